@@ -1,0 +1,87 @@
+// Freestanding helpers shared by the whole image: the firmware tables, pool
+// memory, 8-bit and UCS-2 strings, and the project's own formatter.
+//
+// The image has no C library. Everything here is written against the boot
+// services table and plain loops, so it behaves the same in firmware and in
+// the hosted environment.
+#pragma once
+
+#include "Uefi.h"
+
+// ---------------------------------------------------------------------------
+// Firmware tables, kept by the image entry for every module.
+// ---------------------------------------------------------------------------
+extern EFI_HANDLE gImageHandle;
+extern EFI_SYSTEM_TABLE *gST;
+extern EFI_BOOT_SERVICES *gBS;
+extern EFI_RUNTIME_SERVICES *gRT;
+
+// ---------------------------------------------------------------------------
+// Pool memory (boot-services data). Null when the pool is exhausted or the
+// tables are not set.
+// ---------------------------------------------------------------------------
+void *AllocatePool(UINTN Size);
+void *AllocateZeroPool(UINTN Size);
+void *AllocateCopyPool(UINTN Size, const void *Source);
+void FreePool(void *Buffer); // accepts null
+
+void CopyMem(void *Destination, const void *Source, UINTN Length); // overlap-safe
+void SetMem(void *Buffer, UINTN Length, UINT8 Value);
+void ZeroMem(void *Buffer, UINTN Length);
+INTN CompareMem(const void *A, const void *B, UINTN Length);
+
+// ---------------------------------------------------------------------------
+// 8-bit strings
+// ---------------------------------------------------------------------------
+UINTN AsciiStrLen(const CHAR8 *String);
+UINTN AsciiStrnLen(const CHAR8 *String, UINTN MaxLength);
+INTN AsciiStrCmp(const CHAR8 *A, const CHAR8 *B);
+INTN AsciiStrnCmp(const CHAR8 *A, const CHAR8 *B, UINTN Length);
+// Copies at most DestMax - 1 characters and always terminates (DestMax > 0).
+void AsciiStrCpyS(CHAR8 *Destination, UINTN DestMax, const CHAR8 *Source);
+void AsciiStrCatS(CHAR8 *Destination, UINTN DestMax, const CHAR8 *Source);
+const CHAR8 *AsciiStrStr(const CHAR8 *String, const CHAR8 *SearchString);
+const CHAR8 *AsciiStrChr(const CHAR8 *String, CHAR8 Character);
+// Decimal parse: leading white space, optional sign, digits.
+INT64 AsciiStrDecimalToInt(const CHAR8 *String);
+
+// ---------------------------------------------------------------------------
+// UCS-2 strings
+// ---------------------------------------------------------------------------
+UINTN StrLen(const CHAR16 *String);
+UINTN StrnLen(const CHAR16 *String, UINTN MaxLength);
+INTN StrCmp(const CHAR16 *A, const CHAR16 *B);
+INTN StrnCmp(const CHAR16 *A, const CHAR16 *B, UINTN Length);
+void StrCpyS(CHAR16 *Destination, UINTN DestMax, const CHAR16 *Source);
+void StrCatS(CHAR16 *Destination, UINTN DestMax, const CHAR16 *Source);
+const CHAR16 *StrStr(const CHAR16 *String, const CHAR16 *SearchString);
+CHAR16 *StrDup(const CHAR16 *String); // pool copy, null on failure
+
+// Conversions. The 8-bit side is taken as Latin-1; UCS-2 characters above
+// 0xFF narrow to '?'. Both always terminate within DestMax characters.
+void AsciiStrToUnicodeS(const CHAR8 *Source, CHAR16 *Destination, UINTN DestMax);
+void UnicodeStrToAsciiS(const CHAR16 *Source, CHAR8 *Destination, UINTN DestMax);
+CHAR16 *AsciiStrDupToUnicode(const CHAR8 *Source); // pool, length + 1 characters
+CHAR8 *UnicodeStrDupToAscii(const CHAR16 *Source); // pool, length + 1 characters
+
+// ---------------------------------------------------------------------------
+// Formatter
+//
+// printf-style, with the forms the system's texts use:
+//   %s (8-bit string; in a UCS-2 format string as well), %ls and %S (UCS-2
+//   string), %a (8-bit string), %c, %d %i %u %x %X %o, %p, %%, the length
+//   modifiers h hh l ll z, flags '-' '0' '+' ' ' '#', width and precision
+//   (also '*'), and %pI4 / %pI6 (an IPv4 or IPv6 address given by a pointer
+//   to its 4 or 16 bytes in network order).
+// A null string argument prints "(null)". Output is always terminated; the
+// return value is the count of characters written, without the terminator.
+// ---------------------------------------------------------------------------
+UINTN AsciiVSPrint(CHAR8 *Buffer, UINTN BufferSize, const CHAR8 *Format, va_list Args);
+UINTN AsciiSPrint(CHAR8 *Buffer, UINTN BufferSize, const CHAR8 *Format, ...);
+// UCS-2 output from an 8-bit format.
+UINTN UnicodeVSPrintAsciiFormat(CHAR16 *Buffer, UINTN BufferChars, const CHAR8 *Format,
+                                va_list Args);
+UINTN UnicodeSPrintAsciiFormat(CHAR16 *Buffer, UINTN BufferChars, const CHAR8 *Format, ...);
+// UCS-2 output from a UCS-2 format.
+UINTN UnicodeVSPrint(CHAR16 *Buffer, UINTN BufferChars, const CHAR16 *Format, va_list Args);
+UINTN UnicodeSPrint(CHAR16 *Buffer, UINTN BufferChars, const CHAR16 *Format, ...);
