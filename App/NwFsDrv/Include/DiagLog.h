@@ -33,21 +33,26 @@ void TcpLog(UINT8 Threshold, const CHAR8 *Format, ...);
 void DiagLogV(DiagChannel Channel, UINT8 Threshold, const CHAR8 *Format, va_list Args);
 
 // Status as printed by the standard lines: the error's number (status AND
-// 0xFF) and the status with its top bit cleared (status XOR 2^63); both 0
-// for success.
-constexpr UINT64 DiagStatusNumber(EFI_STATUS Status) { return Status & 0xFF; }
-constexpr UINT64 DiagStatusValue(EFI_STATUS Status) { return Status ^ EFI_ERROR_BIT; }
+// 0xFF) and the status with its top bit cleared; both 0 for success (14 and
+// 0xe for EFI_NOT_FOUND). Clearing rather than flipping the bit keeps a
+// success status at 0.
+constexpr UINT64 DiagStatusNumber(EFI_STATUS Status) {
+  return Status & 0xFF;
+}
+constexpr UINT64 DiagStatusValue(EFI_STATUS Status) {
+  return Status & ~EFI_ERROR_BIT;
+}
 
 // "Function: %s, Line no.: = %d - %s, Status = %lld (0x%llx)\n", printed
 // whatever the level. Function and line default to the call site.
-void DiagError(const CHAR8 *Message, EFI_STATUS Status, const CHAR8 *Function = __builtin_FUNCTION(),
-               UINT32 Line = __builtin_LINE());
+void DiagError(const CHAR8 *Message, EFI_STATUS Status,
+               const CHAR8 *Function = __builtin_FUNCTION(), UINT32 Line = __builtin_LINE());
 // The same line on a given channel at a given threshold.
 void DiagErrorAt(DiagChannel Channel, UINT8 Threshold, const CHAR8 *Message, EFI_STATUS Status,
                  const CHAR8 *Function = __builtin_FUNCTION(), UINT32 Line = __builtin_LINE());
 // "\nFunction: %s, Line no.: = %d. Entered\n" at trace level.
-void DiagEntry(DiagChannel Channel = DiagChannel::Driver, const CHAR8 *Function = __builtin_FUNCTION(),
-               UINT32 Line = __builtin_LINE());
+void DiagEntry(DiagChannel Channel = DiagChannel::Driver,
+               const CHAR8 *Function = __builtin_FUNCTION(), UINT32 Line = __builtin_LINE());
 // "Function: %s, Line no.: = %d. Exiting! Status = %lld (0x%llx)\n" at trace level.
 void DiagExit(EFI_STATUS Status, DiagChannel Channel = DiagChannel::Driver,
               const CHAR8 *Function = __builtin_FUNCTION(), UINT32 Line = __builtin_LINE());
@@ -55,7 +60,18 @@ void DiagExit(EFI_STATUS Status, DiagChannel Channel = DiagChannel::Driver,
 void DiagNullInput(DiagChannel Channel = DiagChannel::Smb2,
                    const CHAR8 *Function = __builtin_FUNCTION(), UINT32 Line = __builtin_LINE());
 
-// The GUID line "Guid = {%08lX-%04hX-...}\n" with an optional prefix format.
+// "Entering %s\n" at trace level.
+void DiagShortEntry(DiagChannel Channel = DiagChannel::Driver,
+                    const CHAR8 *Function = __builtin_FUNCTION());
+// "Exiting %s, Status = 0x%x\n" (Separator ',') or "Exiting %s. Status = 0x%x\n"
+// (Separator '.') at trace level; the status is printed truncated to 32 bits.
+void DiagShortExit(EFI_STATUS Status, CHAR8 Separator = ',',
+                   DiagChannel Channel = DiagChannel::Driver,
+                   const CHAR8 *Function = __builtin_FUNCTION());
+
+// The GUID line "Guid = {%08lX-%04hX-%04hX-%02hhX%02hhX-%02hhX...}\n" on the
+// driver channel. Prefix (may be null) is printed verbatim in front of it, e.g.
+// a "main (221): " built by the caller.
 void DiagGuid(UINT8 Threshold, const CHAR8 *Prefix, const EFI_GUID &Guid);
 
 // The two level initialisers, reading their UEFI variables.

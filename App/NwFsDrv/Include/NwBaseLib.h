@@ -67,14 +67,31 @@ CHAR8 *UnicodeStrDupToAscii(const CHAR16 *Source); // pool, length + 1 character
 // ---------------------------------------------------------------------------
 // Formatter
 //
-// printf-style, with the forms the system's texts use:
-//   %s (8-bit string; in a UCS-2 format string as well), %ls and %S (UCS-2
-//   string), %a (8-bit string), %c, %d %i %u %x %X %o, %p, %%, the length
-//   modifiers h hh l ll z, flags '-' '0' '+' ' ' '#', width and precision
-//   (also '*'), and %pI4 / %pI6 (an IPv4 or IPv6 address given by a pointer
-//   to its 4 or 16 bytes in network order).
-// A null string argument prints "(null)". Output is always terminated; the
-// return value is the count of characters written, without the terminator.
+// printf-style, with the forms the system's texts use. One engine serves the
+// three outputs (8-bit buffer, UCS-2 buffer, console), so the firmware and
+// the hosted build print the same characters for the same call.
+//
+// Strings. The width of %s follows the format string: in an 8-bit format %s
+// takes an 8-bit string, in a UCS-2 format (UnicodeSPrint, DiagLogW) it takes
+// a UCS-2 string. In either kind of format %a and %hs take an 8-bit string
+// and %ls and %S a UCS-2 string. A null string prints "(null)". UCS-2
+// characters above 0xFF print as '?' in 8-bit output.
+//
+// Integers: %d %i %u %x %X %o with the flags '-' '0' '+' ' ' '#', width and
+// precision (also '*') as in C. Length modifiers: none (int), h (short), hh
+// (char), and l, ll, z, j, t, which all take a 64-bit argument. Note that l is
+// 64-bit here although UEFI x64 is LLP64: the texts pass 64-bit values with
+// %ld and %lx, so every %l... argument must be a 64-bit value.
+//
+// Others: %c (an int, printed as one character), %p ("0x" and the pointer in
+// lower-case hex), %pI4 and %pI6 (an IPv4 or IPv6 address from a pointer to
+// its 4 or 16 bytes in network order; IPv6 in the compressed form of
+// RFC 5952, as inet_ntop writes it), %% (a percent sign). A conversion the
+// formatter does not know is printed verbatim, as is a '%' at the end.
+//
+// Output is always terminated when the buffer has room for at least the
+// terminator; the return value is the count of characters stored, without the
+// terminator (output beyond the buffer is dropped).
 // ---------------------------------------------------------------------------
 UINTN AsciiVSPrint(CHAR8 *Buffer, UINTN BufferSize, const CHAR8 *Format, va_list Args);
 UINTN AsciiSPrint(CHAR8 *Buffer, UINTN BufferSize, const CHAR8 *Format, ...);

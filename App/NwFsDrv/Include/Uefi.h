@@ -366,7 +366,7 @@ struct EFI_BOOT_SERVICES {
    const EFI_GUID *EventGroup, EFI_EVENT *Event);
 };
 static_assert(offsetof(EFI_BOOT_SERVICES, AllocatePool) == 24 + 5 * 8, "AllocatePool slot");
-static_assert(offsetof(EFI_BOOT_SERVICES, Stall) == 24 + 29 * 8, "Stall slot");
+static_assert(offsetof(EFI_BOOT_SERVICES, Stall) == 24 + 28 * 8, "Stall slot");
 static_assert(offsetof(EFI_BOOT_SERVICES, OpenProtocol) == 24 + 32 * 8, "OpenProtocol slot");
 static_assert(offsetof(EFI_BOOT_SERVICES, LocateProtocol) == 24 + 37 * 8, "LocateProtocol slot");
 static_assert(sizeof(EFI_BOOT_SERVICES) == 24 + 44 * 8, "boot services table size");
