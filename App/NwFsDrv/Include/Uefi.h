@@ -556,6 +556,11 @@ struct EFI_SHELL_PROTOCOL {
   EFI_EVENT ExecutionBreak;
   UINT32 MajorVersion;
   UINT32 MinorVersion;
+  // Shell 2.1 and later.
+  EFI_STATUS(EFIAPI *RegisterGuidName)(const EFI_GUID *Guid, const CHAR16 *GuidName);
+  EFI_STATUS(EFIAPI *GetGuidName)(const EFI_GUID *Guid, const CHAR16 **GuidName);
+  EFI_STATUS(EFIAPI *GetGuidFromName)(const CHAR16 *GuidName, EFI_GUID *Guid);
+  const CHAR16 *(EFIAPI *GetEnvEx)(const CHAR16 *Name, UINT32 *Attributes);
 };
 static_assert(offsetof(EFI_SHELL_PROTOCOL, GetMapFromDevicePath) == 7 * 8, "GetMapFromDevicePath");
 static_assert(offsetof(EFI_SHELL_PROTOCOL, OpenFileByName) == 24 * 8, "OpenFileByName slot");

@@ -1,0 +1,580 @@
+// The hosted shell and the ramfs: volume: file semantics of the RAM disk,
+// the mapping table, the commands the image runs (map, vol, cd, cp, del) with
+// their redirections, and the EFI_SHELL_PROTOCOL file functions.
+#include "HostImageFixture.h"
+#include "HostInternal.h"
+
+#include <cstring>
+#include <fstream>
+#include <memory>
+#include <sstream>
+
+namespace {
+
+constexpr UINT64 kRead = EFI_FILE_MODE_READ;
+constexpr UINT64 kReadWrite = EFI_FILE_MODE_READ | EFI_FILE_MODE_WRITE;
+constexpr UINT64 kCreate = kReadWrite | EFI_FILE_MODE_CREATE;
+
+std::string Utf8(const CHAR16 *Text) {
+  return Text == nullptr ? "(null)" : HostUcs2ToUtf8(Text);
+}
+
+#pragma pack(push, 1)
+struct VendorPath {
+  EFI_DEVICE_PATH_PROTOCOL Vendor;
+  EFI_GUID Guid;
+  EFI_DEVICE_PATH_PROTOCOL End;
+};
+#pragma pack(pop)
+
+VendorPath MakeVendorPath(UINT32 Tag) {
+  return {{HARDWARE_DEVICE_PATH, HW_VENDOR_DP, {20, 0}},
+          {Tag, 0x1111, 0x2222, {1, 2, 3, 4, 5, 6, 7, 8}},
+          {END_DEVICE_PATH_TYPE, END_ENTIRE_DEVICE_PATH_SUBTYPE, {4, 0}}};
+}
+
+// A volume that passes every call through to the RAM disk and writes down
+// the calls made on files (not on the root handles the shell opens and
+// closes around each path lookup).
+struct RecordingVolume;
+struct RecordingFile {
+  EFI_FILE_PROTOCOL Protocol;
+  EFI_FILE_PROTOCOL *Inner;
+  std::string Name;
+};
+
+struct RecordingVolume {
+  EFI_SIMPLE_FILE_SYSTEM_PROTOCOL Protocol;
+  EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *Inner;
+  VendorPath Path;
+  EFI_HANDLE Handle = nullptr;
+  std::vector<std::string> Calls;
+  std::vector<std::unique_ptr<RecordingFile>> Files;
+};
+RecordingVolume *gRecorder = nullptr;
+
+RecordingFile *Rec(EFI_FILE_PROTOCOL *This) {
+  return reinterpret_cast<RecordingFile *>(This);
+}
+void Note(EFI_FILE_PROTOCOL *This, const std::string &Call) {
+  if (Rec(This)->Name != "\\") {
+    gRecorder->Calls.push_back(Call + "(" + Rec(This)->Name);
+  }
+}
+EFI_FILE_PROTOCOL *Wrap(EFI_FILE_PROTOCOL *Inner, const std::string &Name);
+
+EFI_STATUS EFIAPI RecOpen(EFI_FILE_PROTOCOL *This, EFI_FILE_PROTOCOL **New, const CHAR16 *Name,
+                          UINT64 Mode, UINT64 Attributes) {
+  std::string Text = Utf8(Name);
+  std::string ModeText = Mode == kRead ? "r" : Mode == kReadWrite ? "rw" : "rwc";
+  EFI_FILE_PROTOCOL *Inner = nullptr;
+  EFI_STATUS Status = Rec(This)->Inner->Open(Rec(This)->Inner, &Inner, Name, Mode, Attributes);
+  gRecorder->Calls.push_back("Open(" + Text + "," + ModeText + (EFI_ERROR(Status) ? ")!" : ")"));
+  if (!EFI_ERROR(Status)) {
+    *New = Wrap(Inner, Text);
+  }
+  return Status;
+}
+EFI_STATUS EFIAPI RecClose(EFI_FILE_PROTOCOL *This) {
+  Note(This, "Close");
+  return Rec(This)->Inner->Close(Rec(This)->Inner);
+}
+EFI_STATUS EFIAPI RecDelete(EFI_FILE_PROTOCOL *This) {
+  Note(This, "Delete");
+  return Rec(This)->Inner->Delete(Rec(This)->Inner);
+}
+EFI_STATUS EFIAPI RecRead(EFI_FILE_PROTOCOL *This, UINTN *Size, void *Buffer) {
+  Note(This, "Read," + std::to_string(*Size));
+  return Rec(This)->Inner->Read(Rec(This)->Inner, Size, Buffer);
+}
+EFI_STATUS EFIAPI RecWrite(EFI_FILE_PROTOCOL *This, UINTN *Size, void *Buffer) {
+  Note(This, "Write," + std::to_string(*Size));
+  return Rec(This)->Inner->Write(Rec(This)->Inner, Size, Buffer);
+}
+EFI_STATUS EFIAPI RecGetPosition(EFI_FILE_PROTOCOL *This, UINT64 *Position) {
+  return Rec(This)->Inner->GetPosition(Rec(This)->Inner, Position);
+}
+EFI_STATUS EFIAPI RecSetPosition(EFI_FILE_PROTOCOL *This, UINT64 Position) {
+  Note(This, "SetPosition");
+  return Rec(This)->Inner->SetPosition(Rec(This)->Inner, Position);
+}
+EFI_STATUS EFIAPI RecGetInfo(EFI_FILE_PROTOCOL *This, const EFI_GUID *Type, UINTN *Size,
+                             void *Buffer) {
+  Note(This, "GetInfo");
+  return Rec(This)->Inner->GetInfo(Rec(This)->Inner, Type, Size, Buffer);
+}
+EFI_STATUS EFIAPI RecSetInfo(EFI_FILE_PROTOCOL *This, const EFI_GUID *Type, UINTN Size,
+                             void *Buffer) {
+  Note(This, "SetInfo");
+  return Rec(This)->Inner->SetInfo(Rec(This)->Inner, Type, Size, Buffer);
+}
+EFI_STATUS EFIAPI RecFlush(EFI_FILE_PROTOCOL *This) {
+  return Rec(This)->Inner->Flush(Rec(This)->Inner);
+}
+
+EFI_FILE_PROTOCOL *Wrap(EFI_FILE_PROTOCOL *Inner, const std::string &Name) {
+  auto File = std::make_unique<RecordingFile>();
+  File->Protocol = {EFI_FILE_PROTOCOL_REVISION,
+                    RecOpen,
+                    RecClose,
+                    RecDelete,
+                    RecRead,
+                    RecWrite,
+                    RecGetPosition,
+                    RecSetPosition,
+                    RecGetInfo,
+                    RecSetInfo,
+                    RecFlush};
+  File->Inner = Inner;
+  File->Name = Name;
+  gRecorder->Files.push_back(std::move(File));
+  return &gRecorder->Files.back()->Protocol;
+}
+
+EFI_STATUS EFIAPI RecOpenVolume(EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *, EFI_FILE_PROTOCOL **Root) {
+  EFI_FILE_PROTOCOL *Inner = nullptr;
+  EFI_STATUS Status = gRecorder->Inner->OpenVolume(gRecorder->Inner, &Inner);
+  if (!EFI_ERROR(Status)) {
+    *Root = Wrap(Inner, "\\");
+  }
+  return Status;
+}
+
+class HostShellTest : public HostImageTest {
+protected:
+  void SetUp() override {
+    HostImageTest::SetUp();
+    ASSERT_FALSE(EFI_ERROR(
+        gBS->LocateProtocol(&gEfiShellProtocolGuid, nullptr, reinterpret_cast<void **>(&Shell))));
+  }
+
+  void TearDown() override {
+    RemoveRecorder();
+    EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
+    HostImageTest::TearDown();
+  }
+
+  // Runs a command line; returns Execute's status and the command's.
+  std::pair<EFI_STATUS, EFI_STATUS> Run(const std::u16string &Line, std::string *Out = nullptr) {
+    EFI_HANDLE Parent = HostImageHandle();
+    std::u16string Copy = Line;
+    EFI_STATUS Command = 0xDEAD;
+    EFI_STATUS Launch = EFI_SUCCESS;
+    std::string Text =
+        Console([&] { Launch = Shell->Execute(&Parent, Copy.data(), nullptr, &Command); });
+    if (Out != nullptr) {
+      *Out = Text;
+    }
+    return {Launch, Command};
+  }
+
+  EFI_FILE_PROTOCOL *RamfsRoot() {
+    void *Fs = nullptr;
+    EXPECT_FALSE(
+        EFI_ERROR(gBS->HandleProtocol(HostRamfsHandle(), &gEfiSimpleFileSystemProtocolGuid, &Fs)));
+    EFI_FILE_PROTOCOL *Root = nullptr;
+    auto *Sfs = static_cast<EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *>(Fs);
+    EXPECT_EQ(Sfs->OpenVolume(Sfs, &Root), EFI_SUCCESS);
+    return Root;
+  }
+
+  std::string HostFile(const std::string &Name) {
+    std::ifstream In(RamfsDir + "/" + Name, std::ios::binary);
+    std::stringstream Text;
+    Text << In.rdbuf();
+    return Text.str();
+  }
+  bool HostExists(const std::string &Name) {
+    return std::filesystem::exists(RamfsDir + "/" + Name);
+  }
+  void PutHostFile(const std::string &Name, const std::string &Data) {
+    std::filesystem::create_directories(std::filesystem::path(RamfsDir + "/" + Name).parent_path());
+    std::ofstream(RamfsDir + "/" + Name, std::ios::binary) << Data;
+  }
+
+  // Installs the recording volume in front of the RAM disk.
+  void InstallRecorder(UINT32 Tag) {
+    Recorder = std::make_unique<RecordingVolume>();
+    gRecorder = Recorder.get();
+    void *Inner = nullptr;
+    ASSERT_FALSE(EFI_ERROR(
+        gBS->HandleProtocol(HostRamfsHandle(), &gEfiSimpleFileSystemProtocolGuid, &Inner)));
+    Recorder->Inner = static_cast<EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *>(Inner);
+    Recorder->Protocol = {EFI_SIMPLE_FILE_SYSTEM_PROTOCOL_REVISION, RecOpenVolume};
+    Recorder->Path = MakeVendorPath(Tag);
+    ASSERT_EQ(gBS->InstallMultipleProtocolInterfaces(
+                  &Recorder->Handle, &gEfiSimpleFileSystemProtocolGuid, &Recorder->Protocol,
+                  &gEfiDevicePathProtocolGuid, &Recorder->Path, nullptr),
+              EFI_SUCCESS);
+  }
+
+  void RemoveRecorder() {
+    if (Recorder) {
+      gBS->UninstallMultipleProtocolInterfaces(Recorder->Handle, &gEfiSimpleFileSystemProtocolGuid,
+                                               &Recorder->Protocol, &gEfiDevicePathProtocolGuid,
+                                               &Recorder->Path, nullptr);
+      Recorder.reset();
+      gRecorder = nullptr;
+    }
+  }
+
+  std::string MapOf(const void *Path) {
+    auto *Cursor = static_cast<EFI_DEVICE_PATH_PROTOCOL *>(const_cast<void *>(Path));
+    return Utf8(Shell->GetMapFromDevicePath(&Cursor));
+  }
+
+  EFI_SHELL_PROTOCOL *Shell = nullptr;
+  std::unique_ptr<RecordingVolume> Recorder;
+};
+
+std::vector<UINT8> Info(EFI_FILE_PROTOCOL *File, const EFI_GUID &Type) {
+  UINTN Size = 0;
+  EXPECT_EQ(File->GetInfo(File, &Type, &Size, nullptr), EFI_BUFFER_TOO_SMALL);
+  std::vector<UINT8> Buffer(Size);
+  EXPECT_EQ(File->GetInfo(File, &Type, &Size, Buffer.data()), EFI_SUCCESS);
+  return Buffer;
+}
+const EFI_FILE_INFO *AsInfo(const std::vector<UINT8> &Buffer) {
+  return reinterpret_cast<const EFI_FILE_INFO *>(Buffer.data());
+}
+
+// Every entry name of a directory, read one EFI_FILE_INFO per call.
+std::vector<std::string> List(EFI_FILE_PROTOCOL *Dir) {
+  std::vector<std::string> Names;
+  while (true) {
+    UINTN Size = 0;
+    EFI_STATUS Status = Dir->Read(Dir, &Size, nullptr);
+    if (Status == EFI_SUCCESS && Size == 0) {
+      return Names;
+    }
+    EXPECT_EQ(Status, EFI_BUFFER_TOO_SMALL);
+    std::vector<UINT8> Buffer(Size);
+    EXPECT_EQ(Dir->Read(Dir, &Size, Buffer.data()), EFI_SUCCESS);
+    Names.push_back(Utf8(AsInfo(Buffer)->FileName));
+  }
+}
+
+} // namespace
+
+TEST_F(HostShellTest, RamfsFilesFollowFirmwareSemantics) {
+  EFI_FILE_PROTOCOL *Root = RamfsRoot();
+  EFI_FILE_PROTOCOL *Dir = nullptr;
+  EFI_FILE_PROTOCOL *File = nullptr;
+  ASSERT_EQ(Root->Open(Root, &Dir, u"\\Logs", kCreate, EFI_FILE_DIRECTORY), EFI_SUCCESS);
+  ASSERT_EQ(Dir->Open(Dir, &File, u"Report.TXT", kCreate, 0), EFI_SUCCESS);
+  std::string Data = "hello world";
+  UINTN Size = Data.size();
+  EXPECT_EQ(File->Write(File, &Size, Data.data()), EFI_SUCCESS);
+  EXPECT_EQ(File->SetPosition(File, 6), EFI_SUCCESS);
+  char Buffer[32] = {};
+  Size = sizeof Buffer;
+  EXPECT_EQ(File->Read(File, &Size, Buffer), EFI_SUCCESS);
+  EXPECT_EQ(std::string(Buffer, Size), "world");
+  UINT64 Position = 0;
+  EXPECT_EQ(File->GetPosition(File, &Position), EFI_SUCCESS);
+  EXPECT_EQ(Position, 11u);
+  Size = sizeof Buffer; // at the end: success with nothing
+  EXPECT_EQ(File->Read(File, &Size, Buffer), EFI_SUCCESS);
+  EXPECT_EQ(Size, 0u);
+  EXPECT_EQ(File->SetPosition(File, 20), EFI_SUCCESS);
+  EXPECT_EQ(File->Read(File, &Size, Buffer), EFI_DEVICE_ERROR); // past the end
+  EXPECT_EQ(File->SetPosition(File, 0xFFFFFFFFFFFFFFFFULL), EFI_SUCCESS);
+  Size = 1;
+  EXPECT_EQ(File->Write(File, &Size, const_cast<char *>("!")), EFI_SUCCESS);
+  EXPECT_EQ(HostFile("Logs/Report.TXT"), "hello world!");
+
+  std::vector<UINT8> Fi = Info(File, gEfiFileInfoGuid);
+  EXPECT_EQ(AsInfo(Fi)->FileSize, 12u);
+  EXPECT_EQ(AsInfo(Fi)->Size, SIZE_OF_EFI_FILE_INFO + 11 * sizeof(CHAR16));
+  EXPECT_EQ(Utf8(AsInfo(Fi)->FileName), "Report.TXT");
+  EXPECT_EQ(AsInfo(Fi)->Attribute & EFI_FILE_DIRECTORY, 0u);
+
+  // Names match whatever their case; "." and ".." walk as in a path.
+  EFI_FILE_PROTOCOL *Again = nullptr;
+  ASSERT_EQ(Root->Open(Root, &Again, u"\\LOGS\\.\\..\\logs\\report.txt", kRead, 0), EFI_SUCCESS);
+  Size = 5;
+  EXPECT_EQ(Again->Read(Again, &Size, Buffer), EFI_SUCCESS);
+  EXPECT_EQ(std::string(Buffer, Size), "hello");
+  EXPECT_EQ(Again->Write(Again, &Size, Buffer), EFI_ACCESS_DENIED);
+  EXPECT_EQ(Again->Close(Again), EFI_SUCCESS);
+
+  // Size change and rename through SetInfo.
+  std::vector<UINT8> Changed = Fi;
+  reinterpret_cast<EFI_FILE_INFO *>(Changed.data())->FileSize = 5;
+  EXPECT_EQ(File->SetInfo(File, &gEfiFileInfoGuid, Changed.size(), Changed.data()), EFI_SUCCESS);
+  EXPECT_EQ(HostFile("Logs/Report.TXT"), "hello");
+  std::u16string NewName = u"Moved.txt";
+  Changed.assign(SIZE_OF_EFI_FILE_INFO + (NewName.size() + 1) * sizeof(CHAR16), 0);
+  std::memcpy(Changed.data(), Fi.data(), SIZE_OF_EFI_FILE_INFO);
+  std::memcpy(Changed.data() + SIZE_OF_EFI_FILE_INFO, NewName.c_str(), (NewName.size() + 1) * 2);
+  reinterpret_cast<EFI_FILE_INFO *>(Changed.data())->Size = Changed.size();
+  reinterpret_cast<EFI_FILE_INFO *>(Changed.data())->FileSize = 5;
+  EXPECT_EQ(File->SetInfo(File, &gEfiFileInfoGuid, Changed.size(), Changed.data()), EFI_SUCCESS);
+  EXPECT_TRUE(HostExists("Logs/Moved.txt"));
+  EXPECT_FALSE(HostExists("Logs/Report.TXT"));
+
+  // A record claiming more than the buffer, or with an unterminated name, is refused.
+  reinterpret_cast<EFI_FILE_INFO *>(Changed.data())->Size = Changed.size() + 2;
+  EXPECT_EQ(File->SetInfo(File, &gEfiFileInfoGuid, Changed.size(), Changed.data()),
+            EFI_INVALID_PARAMETER);
+  reinterpret_cast<EFI_FILE_INFO *>(Changed.data())->Size = Changed.size() - 2;
+  EXPECT_EQ(File->SetInfo(File, &gEfiFileInfoGuid, Changed.size(), Changed.data()),
+            EFI_INVALID_PARAMETER);
+  EXPECT_EQ(File->SetInfo(File, &gEfiFileInfoGuid, 10, Changed.data()), EFI_BAD_BUFFER_SIZE);
+
+  EXPECT_EQ(Dir->Write(Dir, &Size, Buffer), EFI_UNSUPPORTED);
+  EXPECT_EQ(Root->Delete(Root), EFI_WARN_DELETE_FAILURE); // the root stays, its handle goes
+  EXPECT_EQ(File->Delete(File), EFI_SUCCESS);
+  EXPECT_FALSE(HostExists("Logs/Moved.txt"));
+
+  EFI_FILE_PROTOCOL *Missing = nullptr;
+  Root = RamfsRoot();
+  EXPECT_EQ(Root->Open(Root, &Missing, u"\\Logs\\none.txt", kRead, 0), EFI_NOT_FOUND);
+  EXPECT_EQ(Root->Open(Root, &Missing, u"\\none\\x.txt", kCreate, 0), EFI_NOT_FOUND);
+  EXPECT_EQ(Root->Open(Root, &Missing, u"\\Logs", EFI_FILE_MODE_WRITE, 0), EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Root->Open(Root, &Missing, u"\\a/..", kCreate, 0), EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Dir->Delete(Dir), EFI_SUCCESS); // empty again
+  EXPECT_FALSE(HostExists("Logs"));
+  Root->Close(Root);
+}
+
+TEST_F(HostShellTest, RamfsDirectoriesListOneEntryPerRead) {
+  PutHostFile("a.bin", "1");
+  PutHostFile("B.bin", "22");
+  PutHostFile("sub/c.bin", "333");
+  EFI_FILE_PROTOCOL *Root = RamfsRoot();
+  EXPECT_EQ(List(Root), (std::vector<std::string>{"B.bin", "a.bin", "sub"}));
+  EXPECT_EQ(List(Root), std::vector<std::string>{}); // exhausted
+  EXPECT_EQ(Root->SetPosition(Root, 0), EFI_SUCCESS);
+  EXPECT_EQ(List(Root).size(), 3u);
+  EXPECT_EQ(Root->SetPosition(Root, 5), EFI_UNSUPPORTED);
+  UINT64 Position = 0;
+  EXPECT_EQ(Root->GetPosition(Root, &Position), EFI_UNSUPPORTED);
+
+  EFI_FILE_PROTOCOL *Sub = nullptr;
+  ASSERT_EQ(Root->Open(Root, &Sub, u"SUB", kReadWrite, 0), EFI_SUCCESS);
+  EXPECT_EQ(List(Sub), (std::vector<std::string>{".", "..", "c.bin"}));
+  EXPECT_EQ(Sub->Delete(Sub), EFI_WARN_DELETE_FAILURE); // not empty
+  EXPECT_TRUE(HostExists("sub/c.bin"));
+
+  std::vector<UINT8> Fs = Info(Root, gEfiFileSystemInfoGuid);
+  auto *FsInfo = reinterpret_cast<const EFI_FILE_SYSTEM_INFO *>(Fs.data());
+  EXPECT_EQ(Utf8(FsInfo->VolumeLabel), "ramfs");
+  EXPECT_EQ(FsInfo->Size, Fs.size());
+  EXPECT_GT(FsInfo->VolumeSize, 0u);
+  std::vector<UINT8> Label = Info(Root, gEfiFileSystemVolumeLabelInfoIdGuid);
+  EXPECT_EQ(Utf8(reinterpret_cast<const CHAR16 *>(Label.data())), "ramfs");
+  UINTN Size = 8;
+  UINT8 Small[8];
+  EXPECT_EQ(Root->GetInfo(Root, &gEfiShellProtocolGuid, &Size, Small), EFI_UNSUPPORTED);
+  Root->Close(Root);
+}
+
+TEST_F(HostShellTest, CopyMovesDataOnlyThroughTheFileProtocolInOrder) {
+  std::string Data(300000, '\0');
+  for (size_t I = 0; I < Data.size(); I++) {
+    Data[I] = static_cast<char>(I * 7 + I / 251);
+  }
+  PutHostFile("src.bin", Data);
+  InstallRecorder(0xC0FFEE);
+  EXPECT_EQ(Run(u"map -u").second, EFI_SUCCESS);
+
+  auto Result = Run(u"cp -q fs1:\\src.bin fs1:\\dst.bin");
+  EXPECT_EQ(Result.first, EFI_SUCCESS);
+  EXPECT_EQ(Result.second, EFI_SUCCESS);
+  EXPECT_EQ(HostFile("dst.bin"), Data);
+  std::vector<std::string> Expected = {
+      "Open(\\src.bin,r)",     "GetInfo(\\src.bin",      "Open(\\dst.bin,r)!",
+      "Open(\\dst.bin,rwc)",   "Read,131072(\\src.bin",  "Write,131072(\\dst.bin",
+      "Read,131072(\\src.bin", "Write,131072(\\dst.bin", "Read,131072(\\src.bin",
+      "Write,37856(\\dst.bin", "Read,131072(\\src.bin",  "Close(\\dst.bin",
+      "Close(\\src.bin"};
+  EXPECT_EQ(gRecorder->Calls, Expected);
+
+  // A second copy replaces the existing destination: it is deleted first.
+  gRecorder->Calls.clear();
+  PutHostFile("small.bin", "tiny");
+  EXPECT_EQ(Run(u"cp -q fs1:\\small.bin fs1:\\DST.BIN").second, EFI_SUCCESS);
+  EXPECT_EQ(HostFile("DST.BIN"), "tiny");
+  ASSERT_GE(gRecorder->Calls.size(), 8u);
+  EXPECT_EQ(gRecorder->Calls[2], "Open(\\DST.BIN,r)");
+  EXPECT_EQ(gRecorder->Calls[5], "Open(\\DST.BIN,rw)");
+  EXPECT_EQ(gRecorder->Calls[6], "Delete(\\DST.BIN");
+  EXPECT_EQ(gRecorder->Calls[7], "Open(\\DST.BIN,rwc)");
+}
+
+TEST_F(HostShellTest, CopyIntoRamfsRootDirectoriesAndErrors) {
+  PutHostFile("share/catalog.xml.gz", "catalog-bytes");
+  PutHostFile("my dir/with space.txt", "spaced");
+  std::string Out;
+  auto Result = Run(u"cp -q ramfs:\\share\\catalog.xml.gz ramfs:\\", &Out);
+  EXPECT_EQ(Result, std::make_pair(EFI_SUCCESS, EFI_SUCCESS)) << Out;
+  EXPECT_EQ(HostFile("catalog.xml.gz"), "catalog-bytes");
+  EXPECT_EQ(Out, ""); // quiet
+
+  // Into an existing directory (no trailing separator), keeping the name.
+  EXPECT_EQ(Run(u"cp \"ramfs:\\my dir\\with space.txt\" RAMFS:\\share", &Out).second, EFI_SUCCESS);
+  EXPECT_EQ(HostFile("share/with space.txt"), "spaced");
+  EXPECT_NE(Out.find("Copying ramfs:\\my dir\\with space.txt -> ramfs:\\share\\with space.txt"),
+            std::string::npos);
+  // Forward slashes separate like backslashes; a missing last directory is created.
+  EXPECT_EQ(Run(u"cp -q ramfs:/share/catalog.xml.gz ramfs:/new/c.gz").second, EFI_SUCCESS);
+  EXPECT_EQ(HostFile("new/c.gz"), "catalog-bytes");
+
+  Result = Run(u"cp -q ramfs:\\share\\none.xml ramfs:\\", &Out);
+  EXPECT_EQ(Result, std::make_pair(EFI_SUCCESS, EFI_NOT_FOUND));
+  EXPECT_NE(Out.find("none.xml"), std::string::npos);
+  EXPECT_EQ(Run(u"cp -q ramfs:\\share ramfs:\\x").second, EFI_UNSUPPORTED);
+  EXPECT_EQ(Run(u"cp -q nosuch:\\a ramfs:\\").second, EFI_NOT_FOUND);
+  EXPECT_EQ(Run(u"cp -q ramfs:\\share\\catalog.xml.gz").second, EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Run(u"cp -z a b").second, EFI_INVALID_PARAMETER);
+}
+
+TEST_F(HostShellTest, MapUpdateAliasesAndDevicePathLookups) {
+  VendorPath Ramfs = MakeVendorPath(0);
+  void *RamfsPath = nullptr;
+  ASSERT_EQ(gBS->HandleProtocol(HostRamfsHandle(), &gEfiDevicePathProtocolGuid, &RamfsPath),
+            EFI_SUCCESS);
+  EXPECT_EQ(MapOf(RamfsPath), "FS0:;ramfs:");
+
+  InstallRecorder(0xA);
+  EXPECT_EQ(MapOf(&Recorder->Path), "(null)"); // new volumes wait for "map -u"
+  std::string Out;
+  EXPECT_EQ(Run(u"map -u", &Out).second, EFI_SUCCESS);
+  EXPECT_NE(Out.find("FS1: VenHw(0000000A-1111-2222-0102-030405060708)"), std::string::npos);
+  EXPECT_EQ(Run(u"map CIFS fs1:").second, EFI_SUCCESS);
+  EFI_DEVICE_PATH_PROTOCOL *Cursor = &Recorder->Path.Vendor;
+  EXPECT_EQ(Utf8(Shell->GetMapFromDevicePath(&Cursor)), "FS1:;CIFS:");
+  EXPECT_EQ(Cursor, &Recorder->Path.End); // moved to the end node
+  for (const CHAR16 *Name : {u"cifs:", u"Cifs", u"fs1"}) {
+    const EFI_DEVICE_PATH_PROTOCOL *Path = Shell->GetDevicePathFromMap(Name);
+    ASSERT_NE(Path, nullptr) << Utf8(Name);
+    EXPECT_EQ(std::memcmp(Path, &Recorder->Path, sizeof(VendorPath)), 0) << Utf8(Name);
+  }
+  EXPECT_EQ(Run(u"map CIFS fs9:").second, EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Run(u"map C*FS fs1:").second, EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Run(u"vol cifs:", &Out).second, EFI_SUCCESS);
+  EXPECT_NE(Out.find("Volume ramfs (rw)"), std::string::npos);
+
+  // A volume that went away loses its names; numbers are not reused.
+  RemoveRecorder();
+  EXPECT_EQ(Run(u"map -u").second, EFI_SUCCESS);
+  EXPECT_EQ(Shell->GetDevicePathFromMap(u"CIFS:"), nullptr);
+  InstallRecorder(0xB);
+  Run(u"map -u");
+  EXPECT_EQ(MapOf(&Recorder->Path), "FS2:");
+  EXPECT_EQ(Run(u"map -r").second, EFI_SUCCESS); // a reset numbers from 0 again
+  EXPECT_EQ(MapOf(RamfsPath), "FS0:;ramfs:");
+  EXPECT_EQ(MapOf(&Recorder->Path), "FS1:");
+  EXPECT_EQ(Run(u"map -d FS1").second, EFI_SUCCESS);
+  EXPECT_EQ(MapOf(&Recorder->Path), "(null)");
+  EXPECT_EQ(Shell->SetMap(&Recorder->Path.Vendor, u"Extra:"), EFI_SUCCESS);
+  EXPECT_EQ(MapOf(&Recorder->Path), "Extra:");
+  EXPECT_EQ(Shell->SetMap(&Ramfs.Vendor, u"Nowhere:"), EFI_NO_MAPPING);
+}
+
+TEST_F(HostShellTest, RedirectionAndDelete) {
+  std::string Out;
+  EXPECT_EQ(Run(u"echo hello > ramfs:\\out.txt", &Out), std::make_pair(EFI_SUCCESS, EFI_SUCCESS));
+  EXPECT_EQ(Out, "");
+  EXPECT_EQ(HostFile("out.txt"), std::string("\xFF\xFEh\0e\0l\0l\0o\0\r\0\n\0", 16));
+  Run(u"echo more >> ramfs:\\out.txt"); // appended, no second byte-order mark
+  EXPECT_EQ(HostFile("out.txt").size(), 16u + 12u);
+  Run(u"echo again > ramfs:\\out.txt"); // starts afresh
+  EXPECT_EQ(HostFile("out.txt").size(), 2u + 14u);
+  Run(u"echo one >a ramfs:\\a.txt");
+  Run(u"echo two >>a ramfs:\\a.txt");
+  EXPECT_EQ(HostFile("a.txt"), "one\r\ntwo\r\n");
+  Run(u"echo \"> not a redirection\"", &Out);
+  EXPECT_EQ(Out, "> not a redirection\r\n");
+
+  // What the image runs for a report: the copy's output goes to the log.
+  PutHostFile("report.zip", "zip");
+  EXPECT_EQ(Run(u"cp ramfs:\\report.zip ramfs:\\copy.zip > ramfs:\\DGRLog.txt", &Out).second,
+            EFI_SUCCESS);
+  EXPECT_EQ(Out, "");
+  EXPECT_NE(HostFile("DGRLog.txt").find(std::string("[\0o\0k\0]", 7)), std::string::npos);
+
+  EXPECT_EQ(Run(u"echo x > nosuch:\\f.txt").first, EFI_NOT_FOUND);
+  EXPECT_EQ(Run(u"echo x >").first, EFI_INVALID_PARAMETER);
+
+  EXPECT_EQ(Run(u"del -q ramfs:\\copy.zip", &Out), std::make_pair(EFI_SUCCESS, EFI_SUCCESS));
+  EXPECT_EQ(Out, "");
+  EXPECT_FALSE(HostExists("copy.zip"));
+  EXPECT_EQ(Run(u"del -q ramfs:\\copy.zip").second, EFI_NOT_FOUND);
+  PutHostFile("full/x", "x");
+  EXPECT_EQ(Run(u"del -q ramfs:\\full").second, EFI_ACCESS_DENIED);
+  EXPECT_EQ(Run(u"del -q ramfs:\\").second, EFI_ACCESS_DENIED);
+  EXPECT_TRUE(HostExists("full/x"));
+}
+
+TEST_F(HostShellTest, ExecuteStatusesAndCurrentDirectory) {
+  std::string Out;
+  EXPECT_EQ(Run(u"frobnicate now", &Out), std::make_pair(EFI_NOT_FOUND, EFI_NOT_FOUND));
+  EXPECT_NE(Out.find("'frobnicate' is not recognized"), std::string::npos);
+  EXPECT_EQ(Run(u"   "), std::make_pair(EFI_SUCCESS, EFI_SUCCESS));
+  EXPECT_EQ(Utf8(Shell->GetEnv(u"lasterror")), "0x0");
+  EXPECT_EQ(Run(u"echo \"open").first, EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Shell->Execute(nullptr, const_cast<CHAR16 *>(u"map"), nullptr, nullptr),
+            EFI_INVALID_PARAMETER);
+
+  EXPECT_EQ(Run(u"cd ostra1:\\Tools").second, EFI_NOT_FOUND);
+  EXPECT_EQ(Utf8(Shell->GetEnv(u"lasterror")), "0xE");
+  EXPECT_EQ(Shell->GetCurDir(nullptr), nullptr);
+  EXPECT_EQ(Run(u"cp -q a.txt b.txt").second, EFI_NOT_FOUND); // relative, nowhere to be
+
+  PutHostFile("Tools/a.txt", "A");
+  EXPECT_EQ(Run(u"cd ramfs:\\tools").second, EFI_SUCCESS);
+  EXPECT_EQ(Utf8(Shell->GetCurDir(nullptr)), "ramfs:\\tools");
+  EXPECT_EQ(Utf8(Shell->GetEnv(u"cwd")), "ramfs:\\tools");
+  EXPECT_EQ(Run(u"cp -q a.txt ..\\b.txt").second, EFI_SUCCESS);
+  EXPECT_EQ(HostFile("b.txt"), "A");
+  EXPECT_EQ(Run(u"cd ramfs:\\b.txt").second, EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Run(u"fs0:").second, EFI_SUCCESS);
+  EXPECT_EQ(Utf8(Shell->GetCurDir(nullptr)), "FS0:\\");
+  EXPECT_EQ(Utf8(Shell->GetCurDir(u"ramfs:")), "ramfs:\\tools");
+  EXPECT_EQ(Run(u"ls ramfs:\\tools", &Out).second, EFI_SUCCESS);
+  EXPECT_NE(Out.find("a.txt"), std::string::npos);
+
+  EXPECT_EQ(Shell->SetEnv(u"Answer", u"42", TRUE), EFI_SUCCESS);
+  EXPECT_EQ(Utf8(Shell->GetEnv(u"ANSWER")), "42");
+  EXPECT_EQ(Shell->SetEnv(u"answer", u"", TRUE), EFI_SUCCESS);
+  EXPECT_EQ(Shell->GetEnv(u"answer"), nullptr);
+  EXPECT_EQ(Shell->MajorVersion, 2u);
+  EXPECT_EQ(Shell->MinorVersion, 2u);
+}
+
+TEST_F(HostShellTest, ShellFileFunctionsWorkThroughTheVolumes) {
+  SHELL_FILE_HANDLE File = nullptr;
+  EXPECT_EQ(Shell->OpenFileByName(u"RAMFS:\\none.txt", &File, kRead), EFI_NOT_FOUND);
+  EXPECT_EQ(File, nullptr);
+  ASSERT_EQ(Shell->CreateFile(u"Ramfs:\\made.txt", 0, &File), EFI_SUCCESS);
+  std::string Data = "made by the shell";
+  UINTN Size = Data.size();
+  EXPECT_EQ(Shell->WriteFile(File, &Size, Data.data()), EFI_SUCCESS);
+  UINT64 FileSize = 0;
+  EXPECT_EQ(Shell->GetFileSize(File, &FileSize), EFI_SUCCESS);
+  EXPECT_EQ(FileSize, Data.size());
+  EFI_FILE_INFO *FileInfo = Shell->GetFileInfo(File);
+  ASSERT_NE(FileInfo, nullptr);
+  EXPECT_EQ(Utf8(FileInfo->FileName), "made.txt");
+  EXPECT_EQ(gBS->FreePool(FileInfo), EFI_SUCCESS); // the caller's, from the pool
+  EXPECT_EQ(Shell->CloseFile(File), EFI_SUCCESS);
+
+  ASSERT_EQ(Shell->OpenFileByName(u"ramfs:\\MADE.TXT", &File, kRead), EFI_SUCCESS);
+  char Buffer[64];
+  Size = sizeof Buffer;
+  EXPECT_EQ(Shell->ReadFile(File, &Size, Buffer), EFI_SUCCESS);
+  EXPECT_EQ(std::string(Buffer, Size), Data);
+  EXPECT_EQ(Shell->CloseFile(File), EFI_SUCCESS);
+  EXPECT_EQ(Shell->DeleteFileByName(u"ramfs:\\made.txt"), EFI_SUCCESS);
+  EXPECT_FALSE(HostExists("made.txt"));
+
+  void *RamfsPath = nullptr;
+  gBS->HandleProtocol(HostRamfsHandle(), &gEfiDevicePathProtocolGuid, &RamfsPath);
+  ASSERT_EQ(Shell->OpenRoot(static_cast<EFI_DEVICE_PATH_PROTOCOL *>(RamfsPath), &File),
+            EFI_SUCCESS);
+  EXPECT_EQ(Shell->CloseFile(File), EFI_SUCCESS);
+  EXPECT_EQ(Shell->BatchIsActive(), FALSE);
+  EXPECT_EQ(Shell->IsRootShell(), TRUE);
+}
