@@ -18,3 +18,14 @@ void HostRamfsUninstall();
 // Unicode Collation 2 answering for "eng", on a handle of its own.
 void HostCollationInstall();
 void HostCollationUninstall();
+
+// Text conversions between the firmware's UCS-2 and the host's UTF-8. UCS-2
+// has no surrogate pairs: every 16-bit unit is one character, and code points
+// outside the basic plane (or malformed UTF-8) become U+FFFD.
+#include <string>
+std::string HostUcs2ToUtf8(const CHAR16 *Text, size_t Length);
+std::string HostUcs2ToUtf8(const CHAR16 *Text); // up to the terminator; null gives ""
+std::u16string HostUtf8ToUcs2(const char *Text);
+
+// The handle HostRamfsInstall put the RAM disk on; null when it is not installed.
+EFI_HANDLE HostRamfsHandle();

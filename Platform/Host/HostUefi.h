@@ -76,3 +76,8 @@ void HostConsoleCaptureBegin();
 // Returns the text written since HostConsoleCaptureBegin, as UTF-8, and ends
 // the capture. The returned pointer stays valid until the next capture.
 const char *HostConsoleCaptureEnd();
+
+// Allocation-failure injection for tests: the next Allocations pool
+// allocations succeed and the one after them fails (once). UINT64_MAX turns
+// the injection off; HostShutdown does as well.
+void HostPoolFailAfter(uint64_t Allocations);

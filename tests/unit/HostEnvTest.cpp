@@ -1,0 +1,876 @@
+// The hosted UEFI environment seen through its tables, the way the image sees
+// it: the counted pool, events and timers under TPL rules, the handle
+// database and driver model, the variable store file, the console, the
+// configuration tables and Unicode Collation.
+#include "HostUefi.h"
+#include "IpmiTransport.h"
+
+#include <gtest/gtest.h>
+
+#include <stdlib.h>
+#include <string.h>
+
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+#include <string>
+#include <vector>
+
+namespace {
+
+const EFI_GUID kGuidA = {
+    0x11111111, 0x2222, 0x3333, {0x44, 0x44, 0x55, 0x55, 0x55, 0x55, 0x55, 0x51}};
+const EFI_GUID kGuidB = {
+    0x11111111, 0x2222, 0x3333, {0x44, 0x44, 0x55, 0x55, 0x55, 0x55, 0x55, 0x52}};
+const EFI_GUID kProvisioningGuid = {
+    0x4C4AC96B, 0xDD0A, 0x447E, {0x81, 0x18, 0x10, 0x59, 0x00, 0xDA, 0x86, 0x29}};
+
+class HostEnv : public ::testing::Test {
+protected:
+  void SetUp() override {
+    char Template[] = "/tmp/hostenv-XXXXXX";
+    ASSERT_NE(mkdtemp(Template), nullptr);
+    Dir = Template;
+    StorePath = Dir + "/vars.txt";
+    RamfsPath = Dir + "/ramfs";
+    HostConfig Config;
+    Config.RamfsDir = RamfsPath.c_str();
+    Config.VarStore = StorePath.c_str();
+    St = HostInitialize(Config);
+    ASSERT_NE(St, nullptr);
+    Bs = St->BootServices;
+    Rt = St->RuntimeServices;
+  }
+  void TearDown() override {
+    HostShutdown();
+    std::filesystem::remove_all(Dir);
+  }
+
+  std::string ReadStore() {
+    std::ifstream In(StorePath);
+    std::stringstream Text;
+    Text << In.rdbuf();
+    return Text.str();
+  }
+
+  std::string Dir, StorePath, RamfsPath;
+  EFI_SYSTEM_TABLE *St = nullptr;
+  EFI_BOOT_SERVICES *Bs = nullptr;
+  EFI_RUNTIME_SERVICES *Rt = nullptr;
+};
+
+// ---------------------------------------------------------------------------
+// Pool
+// ---------------------------------------------------------------------------
+TEST_F(HostEnv, PoolCountsBlocksAndBytesAndRejectsForeignPointers) {
+  uint64_t Blocks = HostPoolOutstanding();
+  uint64_t Bytes = HostPoolOutstandingBytes();
+  void *A = nullptr;
+  void *B = nullptr;
+  ASSERT_EQ(Bs->AllocatePool(EfiBootServicesData, 100, &A), EFI_SUCCESS);
+  ASSERT_EQ(Bs->AllocatePool(EfiBootServicesData, 28, &B), EFI_SUCCESS);
+  EXPECT_EQ(HostPoolOutstanding(), Blocks + 2);
+  EXPECT_EQ(HostPoolOutstandingBytes(), Bytes + 128);
+
+  int OnStack = 0;
+  EXPECT_EQ(Bs->FreePool(&OnStack), EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Bs->FreePool(nullptr), EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Bs->FreePool(A), EFI_SUCCESS);
+  EXPECT_EQ(Bs->FreePool(A), EFI_INVALID_PARAMETER); // double free is caught
+  EXPECT_EQ(Bs->FreePool(B), EFI_SUCCESS);
+  EXPECT_EQ(HostPoolOutstanding(), Blocks);
+  EXPECT_EQ(HostPoolOutstandingBytes(), Bytes);
+}
+
+TEST_F(HostEnv, PoolFailureInjectionFailsExactlyOneAllocation) {
+  void *Blocks[3] = {};
+  HostPoolFailAfter(1);
+  EXPECT_EQ(Bs->AllocatePool(EfiBootServicesData, 8, &Blocks[0]), EFI_SUCCESS);
+  EXPECT_EQ(Bs->AllocatePool(EfiBootServicesData, 8, &Blocks[1]), EFI_OUT_OF_RESOURCES);
+  EXPECT_EQ(Bs->AllocatePool(EfiBootServicesData, 8, &Blocks[2]), EFI_SUCCESS);
+  Bs->FreePool(Blocks[0]);
+  Bs->FreePool(Blocks[2]);
+}
+
+// ---------------------------------------------------------------------------
+// Events, timers and TPL
+// ---------------------------------------------------------------------------
+struct NotifyLog {
+  int Count = 0;
+  EFI_TPL TplSeen = 0;
+  EFI_BOOT_SERVICES *Bs = nullptr;
+};
+
+void EFIAPI CountNotify(EFI_EVENT, void *Context) {
+  NotifyLog *Log = static_cast<NotifyLog *>(Context);
+  Log->Count++;
+  // The level a notification runs at is the one RaiseTPL reports as current.
+  Log->TplSeen = Log->Bs->RaiseTPL(TPL_HIGH_LEVEL);
+  Log->Bs->RestoreTPL(Log->TplSeen);
+}
+
+// Like the keep-alive: cancels itself and re-arms for later.
+void EFIAPI RearmNotify(EFI_EVENT Event, void *Context) {
+  NotifyLog *Log = static_cast<NotifyLog *>(Context);
+  Log->Count++;
+  Log->Bs->SetTimer(Event, TimerCancel, 0);
+  Log->Bs->SetTimer(Event, TimerRelative, 100000); // 10 ms
+}
+
+void EFIAPI CloseSelfNotify(EFI_EVENT Event, void *Context) {
+  NotifyLog *Log = static_cast<NotifyLog *>(Context);
+  Log->Count++;
+  Log->Bs->CloseEvent(Event);
+}
+
+TEST_F(HostEnv, RelativeTimerNotifiesOnceInsideStallAtItsOwnLevel) {
+  NotifyLog Log;
+  Log.Bs = Bs;
+  EFI_EVENT Timer = nullptr;
+  ASSERT_EQ(Bs->CreateEvent(EVT_TIMER | EVT_NOTIFY_SIGNAL, TPL_CALLBACK, CountNotify, &Log, &Timer),
+            EFI_SUCCESS);
+  ASSERT_EQ(Bs->SetTimer(Timer, TimerRelative, 100000), EFI_SUCCESS); // 10 ms
+  EXPECT_EQ(Log.Count, 0);
+  Bs->Stall(40000);
+  EXPECT_EQ(Log.Count, 1);
+  EXPECT_EQ(Log.TplSeen, TPL_CALLBACK);
+  Bs->Stall(30000);
+  EXPECT_EQ(Log.Count, 1);
+  EXPECT_EQ(Bs->CloseEvent(Timer), EFI_SUCCESS);
+  EXPECT_EQ(Bs->CloseEvent(Timer), EFI_INVALID_PARAMETER);
+}
+
+TEST_F(HostEnv, PeriodicTimerAndSelfRearmingTimerKeepFiring) {
+  NotifyLog Periodic, Rearm;
+  Periodic.Bs = Rearm.Bs = Bs;
+  EFI_EVENT P = nullptr;
+  EFI_EVENT R = nullptr;
+  ASSERT_EQ(
+      Bs->CreateEvent(EVT_TIMER | EVT_NOTIFY_SIGNAL, TPL_CALLBACK, CountNotify, &Periodic, &P),
+      EFI_SUCCESS);
+  ASSERT_EQ(Bs->CreateEvent(EVT_TIMER | EVT_NOTIFY_SIGNAL, TPL_CALLBACK, RearmNotify, &Rearm, &R),
+            EFI_SUCCESS);
+  Bs->SetTimer(P, TimerPeriodic, 100000);
+  Bs->SetTimer(R, TimerRelative, 100000);
+  Bs->Stall(65000);
+  // Missed periods are not made up, so a loaded machine may see fewer.
+  EXPECT_GE(Periodic.Count, 2);
+  EXPECT_LE(Periodic.Count, 6);
+  EXPECT_GE(Rearm.Count, 2);
+  Bs->SetTimer(P, TimerCancel, 0);
+  int Frozen = Periodic.Count;
+  Bs->Stall(25000);
+  EXPECT_EQ(Periodic.Count, Frozen);
+  Bs->CloseEvent(P);
+  Bs->CloseEvent(R);
+}
+
+TEST_F(HostEnv, RaisedTplHoldsNotificationsUntilRestore) {
+  NotifyLog Log;
+  Log.Bs = Bs;
+  EFI_EVENT Timer = nullptr;
+  ASSERT_EQ(Bs->CreateEvent(EVT_TIMER | EVT_NOTIFY_SIGNAL, TPL_CALLBACK, CountNotify, &Log, &Timer),
+            EFI_SUCCESS);
+  EFI_TPL Old = Bs->RaiseTPL(TPL_CALLBACK); // equal level masks too
+  EXPECT_EQ(Old, TPL_APPLICATION);
+  Bs->SetTimer(Timer, TimerRelative, 0);
+  Bs->Stall(5000);
+  HostDispatchTimers();
+  EXPECT_EQ(Log.Count, 0);
+  Bs->RestoreTPL(Old);
+  EXPECT_EQ(Log.Count, 1);
+
+  // A signalled notify event at a higher level runs at once.
+  EFI_EVENT Signal = nullptr;
+  ASSERT_EQ(Bs->CreateEvent(EVT_NOTIFY_SIGNAL, TPL_NOTIFY, CountNotify, &Log, &Signal),
+            EFI_SUCCESS);
+  Old = Bs->RaiseTPL(TPL_CALLBACK);
+  EXPECT_EQ(Bs->SignalEvent(Signal), EFI_SUCCESS);
+  EXPECT_EQ(Log.Count, 2);
+  EXPECT_EQ(Log.TplSeen, TPL_NOTIFY);
+  Bs->RestoreTPL(Old);
+  EXPECT_EQ(Bs->CheckEvent(Signal), EFI_INVALID_PARAMETER); // not for notify-signal events
+  Bs->CloseEvent(Timer);
+  Bs->CloseEvent(Signal);
+}
+
+TEST_F(HostEnv, EventGroupsAndClosingFromOwnNotification) {
+  NotifyLog First, Second, Closer;
+  First.Bs = Second.Bs = Closer.Bs = Bs;
+  EFI_EVENT E1 = nullptr, E2 = nullptr, E3 = nullptr;
+  ASSERT_EQ(Bs->CreateEventEx(EVT_NOTIFY_SIGNAL, TPL_CALLBACK, CountNotify, &First, &kGuidA, &E1),
+            EFI_SUCCESS);
+  ASSERT_EQ(Bs->CreateEventEx(EVT_NOTIFY_SIGNAL, TPL_CALLBACK, CountNotify, &Second, &kGuidA, &E2),
+            EFI_SUCCESS);
+  Bs->SignalEvent(E2);
+  EXPECT_EQ(First.Count, 1);
+  EXPECT_EQ(Second.Count, 1);
+
+  ASSERT_EQ(
+      Bs->CreateEvent(EVT_TIMER | EVT_NOTIFY_SIGNAL, TPL_CALLBACK, CloseSelfNotify, &Closer, &E3),
+      EFI_SUCCESS);
+  Bs->SetTimer(E3, TimerPeriodic, 10000);
+  Bs->Stall(10000);
+  Bs->Stall(10000);
+  EXPECT_EQ(Closer.Count, 1);
+  EXPECT_EQ(Bs->CloseEvent(E3), EFI_INVALID_PARAMETER); // already gone
+  Bs->CloseEvent(E1);
+  Bs->CloseEvent(E2);
+}
+
+TEST_F(HostEnv, EventArgumentsAreValidated) {
+  EFI_EVENT E = nullptr;
+  EXPECT_EQ(Bs->CreateEvent(EVT_NOTIFY_SIGNAL, TPL_CALLBACK, nullptr, nullptr, &E),
+            EFI_INVALID_PARAMETER);
+  EXPECT_EQ(
+      Bs->CreateEvent(EVT_NOTIFY_SIGNAL | EVT_NOTIFY_WAIT, TPL_CALLBACK, CountNotify, nullptr, &E),
+      EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Bs->CreateEvent(EVT_NOTIFY_SIGNAL, TPL_HIGH_LEVEL, CountNotify, nullptr, &E),
+            EFI_INVALID_PARAMETER);
+  ASSERT_EQ(Bs->CreateEvent(0, 0, nullptr, nullptr, &E), EFI_SUCCESS);
+  EXPECT_EQ(Bs->SetTimer(E, TimerRelative, 10), EFI_INVALID_PARAMETER); // not a timer
+  EXPECT_EQ(Bs->CheckEvent(E), EFI_NOT_READY);
+  Bs->SignalEvent(E);
+  EXPECT_EQ(Bs->CheckEvent(E), EFI_SUCCESS);
+  EXPECT_EQ(Bs->CheckEvent(E), EFI_NOT_READY); // checking consumes the signal
+  Bs->CloseEvent(E);
+}
+
+TEST_F(HostEnv, WaitForEventReturnsTheSignalledEventAndRefusesHopelessWaits) {
+  EFI_EVENT Timer = nullptr, Plain = nullptr;
+  // The network busy lock's kind of event: a timer without notification.
+  ASSERT_EQ(Bs->CreateEvent(EVT_TIMER, TPL_CALLBACK, nullptr, nullptr, &Timer), EFI_SUCCESS);
+  ASSERT_EQ(Bs->CreateEvent(0, 0, nullptr, nullptr, &Plain), EFI_SUCCESS);
+  Bs->SetTimer(Timer, TimerRelative, 100000);
+  EFI_EVENT Both[2] = {Plain, Timer};
+  UINTN Index = 99;
+  EXPECT_EQ(Bs->WaitForEvent(2, Both, &Index), EFI_SUCCESS);
+  EXPECT_EQ(Index, 1u);
+
+  // Nothing can ever signal these now: refused instead of hanging.
+  EXPECT_EQ(Bs->WaitForEvent(2, Both, &Index), EFI_INVALID_PARAMETER);
+  Bs->SignalEvent(Plain);
+  EXPECT_EQ(Bs->WaitForEvent(2, Both, &Index), EFI_SUCCESS);
+  EXPECT_EQ(Index, 0u);
+
+  EFI_TPL Old = Bs->RaiseTPL(TPL_CALLBACK);
+  EXPECT_EQ(Bs->WaitForEvent(1, &Timer, &Index), EFI_UNSUPPORTED);
+  Bs->RestoreTPL(Old);
+  Bs->CloseEvent(Timer);
+  Bs->CloseEvent(Plain);
+}
+
+// A wait-notify function polls a "device" and signals its event when ready.
+void EFIAPI PollNotify(EFI_EVENT Event, void *Context) {
+  NotifyLog *Log = static_cast<NotifyLog *>(Context);
+  if (++Log->Count == 3) {
+    Log->Bs->SignalEvent(Event);
+  }
+}
+
+TEST_F(HostEnv, WaitForEventPollsWaitNotifyEventsUntilTheySignal) {
+  NotifyLog Log;
+  Log.Bs = Bs;
+  EFI_EVENT Event = nullptr;
+  ASSERT_EQ(Bs->CreateEvent(EVT_NOTIFY_WAIT, TPL_CALLBACK, PollNotify, &Log, &Event), EFI_SUCCESS);
+  UINTN Index = 9;
+  EXPECT_EQ(Bs->WaitForEvent(1, &Event, &Index), EFI_SUCCESS);
+  EXPECT_EQ(Index, 0u);
+  EXPECT_EQ(Log.Count, 3);
+  Bs->CloseEvent(Event);
+}
+
+// ---------------------------------------------------------------------------
+// Handle database
+// ---------------------------------------------------------------------------
+std::vector<EFI_HANDLE> HandlesWith(EFI_BOOT_SERVICES *Bs, const EFI_GUID &Guid) {
+  UINTN Count = 0;
+  EFI_HANDLE *Buffer = nullptr;
+  std::vector<EFI_HANDLE> Result;
+  if (Bs->LocateHandleBuffer(ByProtocol, &Guid, nullptr, &Count, &Buffer) == EFI_SUCCESS) {
+    Result.assign(Buffer, Buffer + Count);
+    Bs->FreePool(Buffer);
+  }
+  return Result;
+}
+
+TEST_F(HostEnv, HandlesAreListedInCreationOrderAndVanishWithTheirLastProtocol) {
+  int Ia = 1, Ib = 2, Ic = 3;
+  EFI_HANDLE H1 = nullptr, H2 = nullptr, H3 = nullptr;
+  ASSERT_EQ(Bs->InstallProtocolInterface(&H1, &kGuidA, EFI_NATIVE_INTERFACE, &Ia), EFI_SUCCESS);
+  ASSERT_EQ(Bs->InstallProtocolInterface(&H2, &kGuidB, EFI_NATIVE_INTERFACE, &Ib), EFI_SUCCESS);
+  ASSERT_EQ(Bs->InstallProtocolInterface(&H3, &kGuidA, EFI_NATIVE_INTERFACE, &Ic), EFI_SUCCESS);
+  EXPECT_EQ(HandlesWith(Bs, kGuidA), (std::vector<EFI_HANDLE>{H1, H3}));
+  EXPECT_EQ(Bs->InstallProtocolInterface(&H1, &kGuidA, EFI_NATIVE_INTERFACE, &Ic),
+            EFI_INVALID_PARAMETER);
+
+  void *Found = nullptr;
+  EXPECT_EQ(Bs->LocateProtocol(&kGuidA, nullptr, &Found), EFI_SUCCESS);
+  EXPECT_EQ(Found, &Ia);
+
+  // LocateHandle reports the size it needs.
+  UINTN Size = sizeof(EFI_HANDLE);
+  EFI_HANDLE Two[2] = {};
+  EXPECT_EQ(Bs->LocateHandle(ByProtocol, &kGuidA, nullptr, &Size, Two), EFI_BUFFER_TOO_SMALL);
+  EXPECT_EQ(Size, 2 * sizeof(EFI_HANDLE));
+  EXPECT_EQ(Bs->LocateHandle(ByProtocol, &kGuidA, nullptr, &Size, Two), EFI_SUCCESS);
+
+  EXPECT_EQ(Bs->UninstallProtocolInterface(H1, &kGuidA, &Ib), EFI_NOT_FOUND); // wrong interface
+  EXPECT_EQ(Bs->UninstallProtocolInterface(H1, &kGuidA, &Ia), EFI_SUCCESS);
+  EXPECT_EQ(Bs->HandleProtocol(H1, &kGuidA, &Found), EFI_INVALID_PARAMETER); // handle gone
+  EXPECT_EQ(HandlesWith(Bs, kGuidA), (std::vector<EFI_HANDLE>{H3}));
+  EXPECT_EQ(Bs->LocateProtocol(&kGuidA, nullptr, &Found), EFI_SUCCESS);
+  EXPECT_EQ(Found, &Ic);
+  EXPECT_EQ(Bs->HandleProtocol(H2, &kGuidA, &Found), EFI_UNSUPPORTED);
+
+  Bs->UninstallProtocolInterface(H2, &kGuidB, &Ib);
+  Bs->UninstallProtocolInterface(H3, &kGuidA, &Ic);
+  EXPECT_TRUE(HandlesWith(Bs, kGuidA).empty());
+}
+
+TEST_F(HostEnv, ImageHandleSurvivesLosingItsProtocols) {
+  EFI_HANDLE Image = HostImageHandle();
+  int I = 0;
+  ASSERT_EQ(Bs->InstallProtocolInterface(&Image, &kGuidA, EFI_NATIVE_INTERFACE, &I), EFI_SUCCESS);
+  EXPECT_EQ(Image, HostImageHandle());
+  ASSERT_EQ(Bs->UninstallProtocolInterface(Image, &kGuidA, &I), EFI_SUCCESS);
+  EXPECT_EQ(Bs->InstallProtocolInterface(&Image, &kGuidB, EFI_NATIVE_INTERFACE, &I), EFI_SUCCESS);
+  Bs->UninstallProtocolInterface(Image, &kGuidB, &I);
+}
+
+TEST_F(HostEnv, InstallMultipleIsAllOrNothing) {
+  int Ia = 1, Ib = 2;
+  // A GUID twice in one call fails on the second and takes the first back.
+  EFI_HANDLE Fresh = nullptr;
+  EXPECT_EQ(Bs->InstallMultipleProtocolInterfaces(&Fresh, &kGuidA, &Ia, &kGuidB, &Ib, &kGuidA, &Ia,
+                                                  nullptr),
+            EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Fresh, nullptr);
+  EXPECT_TRUE(HandlesWith(Bs, kGuidA).empty());
+  EXPECT_TRUE(HandlesWith(Bs, kGuidB).empty());
+
+  EFI_HANDLE H = nullptr;
+  ASSERT_EQ(Bs->InstallMultipleProtocolInterfaces(&H, &kGuidA, &Ia, nullptr), EFI_SUCCESS);
+  EXPECT_EQ(Bs->InstallMultipleProtocolInterfaces(&H, &kGuidB, &Ib, &kGuidA, &Ia, nullptr),
+            EFI_INVALID_PARAMETER);
+  EXPECT_TRUE(HandlesWith(Bs, kGuidB).empty());
+
+  // Uninstall: one wrong interface puts the others back.
+  ASSERT_EQ(Bs->InstallMultipleProtocolInterfaces(&H, &kGuidB, &Ib, nullptr), EFI_SUCCESS);
+  EXPECT_EQ(Bs->UninstallMultipleProtocolInterfaces(H, &kGuidA, &Ia, &kGuidB, &Ia, nullptr),
+            EFI_INVALID_PARAMETER);
+  EXPECT_EQ(HandlesWith(Bs, kGuidA), std::vector<EFI_HANDLE>{H});
+  EXPECT_EQ(Bs->UninstallMultipleProtocolInterfaces(H, &kGuidA, &Ia, &kGuidB, &Ib, nullptr),
+            EFI_SUCCESS);
+  EXPECT_TRUE(HandlesWith(Bs, kGuidA).empty());
+}
+
+#pragma pack(push, 1)
+struct VendorPath {
+  EFI_DEVICE_PATH_PROTOCOL Vendor;
+  EFI_GUID Guid;
+  EFI_DEVICE_PATH_PROTOCOL End;
+};
+#pragma pack(pop)
+
+VendorPath MakeVendorPath(const EFI_GUID &Guid) {
+  return VendorPath{{HARDWARE_DEVICE_PATH, HW_VENDOR_DP, {20, 0}},
+                    Guid,
+                    {END_DEVICE_PATH_TYPE, END_ENTIRE_DEVICE_PATH_SUBTYPE, {4, 0}}};
+}
+
+TEST_F(HostEnv, DevicePathsAreUniqueAndLocatedByPrefix) {
+  VendorPath Path = MakeVendorPath(kGuidA);
+  VendorPath Same = Path;
+  int Ia = 1;
+  EFI_HANDLE H = nullptr, Other = nullptr;
+  ASSERT_EQ(Bs->InstallMultipleProtocolInterfaces(&H, &gEfiDevicePathProtocolGuid, &Path, &kGuidA,
+                                                  &Ia, nullptr),
+            EFI_SUCCESS);
+  EXPECT_EQ(
+      Bs->InstallMultipleProtocolInterfaces(&Other, &gEfiDevicePathProtocolGuid, &Same, nullptr),
+      EFI_ALREADY_STARTED);
+
+  EFI_DEVICE_PATH_PROTOCOL *Cursor = &Same.Vendor;
+  EFI_HANDLE Device = nullptr;
+  EXPECT_EQ(Bs->LocateDevicePath(&kGuidA, &Cursor, &Device), EFI_SUCCESS);
+  EXPECT_EQ(Device, H);
+  EXPECT_EQ(Cursor, &Same.End);
+  VendorPath Unknown = MakeVendorPath(kGuidB);
+  Cursor = &Unknown.Vendor;
+  EXPECT_EQ(Bs->LocateDevicePath(&kGuidA, &Cursor, &Device), EFI_NOT_FOUND);
+  Bs->UninstallMultipleProtocolInterfaces(H, &gEfiDevicePathProtocolGuid, &Path, &kGuidA, &Ia,
+                                          nullptr);
+}
+
+// A driver that takes kGuidA on a controller by driver and lets go in Stop.
+struct FakeDriver {
+  EFI_DRIVER_BINDING_PROTOCOL Binding; // first: the interface is the record
+  EFI_BOOT_SERVICES *Bs;
+  int Started, Stopped;
+  bool CloseOnStop;
+};
+
+EFI_STATUS EFIAPI FakeSupported(EFI_DRIVER_BINDING_PROTOCOL *This, EFI_HANDLE Controller,
+                                EFI_DEVICE_PATH_PROTOCOL *) {
+  FakeDriver *D = reinterpret_cast<FakeDriver *>(This);
+  return D->Bs->OpenProtocol(Controller, &kGuidA, nullptr, This->DriverBindingHandle, Controller,
+                             EFI_OPEN_PROTOCOL_TEST_PROTOCOL);
+}
+
+EFI_STATUS EFIAPI FakeStart(EFI_DRIVER_BINDING_PROTOCOL *This, EFI_HANDLE Controller,
+                            EFI_DEVICE_PATH_PROTOCOL *) {
+  FakeDriver *D = reinterpret_cast<FakeDriver *>(This);
+  void *Interface = nullptr;
+  EFI_STATUS Status =
+      D->Bs->OpenProtocol(Controller, &kGuidA, &Interface, This->DriverBindingHandle, Controller,
+                          EFI_OPEN_PROTOCOL_BY_DRIVER);
+  D->Started += Status == EFI_SUCCESS;
+  return Status;
+}
+
+EFI_STATUS EFIAPI FakeStop(EFI_DRIVER_BINDING_PROTOCOL *This, EFI_HANDLE Controller, UINTN,
+                           EFI_HANDLE *) {
+  FakeDriver *D = reinterpret_cast<FakeDriver *>(This);
+  D->Stopped++;
+  if (D->CloseOnStop) {
+    D->Bs->CloseProtocol(Controller, &kGuidA, This->DriverBindingHandle, Controller);
+  }
+  return EFI_SUCCESS;
+}
+
+FakeDriver MakeDriver(EFI_BOOT_SERVICES *Bs) {
+  return FakeDriver{{FakeSupported, FakeStart, FakeStop, 0x10, nullptr, nullptr}, Bs, 0, 0, true};
+}
+
+void InstallDriver(EFI_BOOT_SERVICES *Bs, FakeDriver &D, EFI_HANDLE *Handle) {
+  ASSERT_EQ(Bs->InstallProtocolInterface(Handle, &gEfiDriverBindingProtocolGuid,
+                                         EFI_NATIVE_INTERFACE, &D.Binding),
+            EFI_SUCCESS);
+  D.Binding.ImageHandle = D.Binding.DriverBindingHandle = *Handle;
+}
+
+TEST_F(HostEnv, ByDriverOpensAreExclusiveToOneDriverAndRecorded) {
+  int Ia = 1;
+  EFI_HANDLE Controller = nullptr, Driver1 = nullptr, Driver2 = nullptr;
+  ASSERT_EQ(Bs->InstallProtocolInterface(&Controller, &kGuidA, EFI_NATIVE_INTERFACE, &Ia),
+            EFI_SUCCESS);
+  FakeDriver D1 = MakeDriver(Bs), D2 = MakeDriver(Bs);
+  InstallDriver(Bs, D1, &Driver1);
+  InstallDriver(Bs, D2, &Driver2);
+
+  void *Interface = nullptr;
+  EXPECT_EQ(Bs->OpenProtocol(Controller, &kGuidA, &Interface, Driver1, Controller,
+                             EFI_OPEN_PROTOCOL_BY_DRIVER),
+            EFI_SUCCESS);
+  EXPECT_EQ(Interface, &Ia);
+  EXPECT_EQ(Bs->OpenProtocol(Controller, &kGuidA, &Interface, Driver1, Controller,
+                             EFI_OPEN_PROTOCOL_BY_DRIVER),
+            EFI_ALREADY_STARTED);
+  EXPECT_EQ(Bs->OpenProtocol(Controller, &kGuidA, &Interface, Driver2, Controller,
+                             EFI_OPEN_PROTOCOL_BY_DRIVER),
+            EFI_ACCESS_DENIED);
+  EXPECT_EQ(Bs->OpenProtocol(Controller, &kGuidB, &Interface, Driver2, Controller,
+                             EFI_OPEN_PROTOCOL_GET_PROTOCOL),
+            EFI_UNSUPPORTED);
+  EXPECT_EQ(Interface, nullptr);
+  EXPECT_EQ(Bs->OpenProtocol(Controller, &kGuidA, &Interface, Driver2, nullptr,
+                             EFI_OPEN_PROTOCOL_GET_PROTOCOL),
+            EFI_SUCCESS);
+
+  EFI_OPEN_PROTOCOL_INFORMATION_ENTRY *Info = nullptr;
+  UINTN Count = 0;
+  ASSERT_EQ(Bs->OpenProtocolInformation(Controller, &kGuidA, &Info, &Count), EFI_SUCCESS);
+  ASSERT_EQ(Count, 2u);
+  EXPECT_EQ(Info[0].AgentHandle, Driver1);
+  EXPECT_EQ(Info[0].Attributes, EFI_OPEN_PROTOCOL_BY_DRIVER);
+  EXPECT_EQ(Info[1].AgentHandle, Driver2);
+  Bs->FreePool(Info);
+
+  EXPECT_EQ(Bs->CloseProtocol(Controller, &kGuidA, Driver2, Controller), EFI_NOT_FOUND);
+  EXPECT_EQ(Bs->CloseProtocol(Controller, &kGuidA, Driver2, nullptr), EFI_SUCCESS);
+  EXPECT_EQ(Bs->CloseProtocol(Controller, &kGuidA, Driver1, Controller), EFI_SUCCESS);
+  Bs->UninstallProtocolInterface(Controller, &kGuidA, &Ia);
+  Bs->UninstallProtocolInterface(Driver1, &gEfiDriverBindingProtocolGuid, &D1.Binding);
+  Bs->UninstallProtocolInterface(Driver2, &gEfiDriverBindingProtocolGuid, &D2.Binding);
+}
+
+TEST_F(HostEnv, ConnectStartsSupportingDriversAndDisconnectStopsThem) {
+  int Ia = 1;
+  EFI_HANDLE Controller = nullptr, Bare = nullptr, Driver1 = nullptr, Driver2 = nullptr;
+  ASSERT_EQ(Bs->InstallProtocolInterface(&Controller, &kGuidA, EFI_NATIVE_INTERFACE, &Ia),
+            EFI_SUCCESS);
+  ASSERT_EQ(Bs->InstallProtocolInterface(&Bare, &kGuidB, EFI_NATIVE_INTERFACE, &Ia), EFI_SUCCESS);
+  FakeDriver D1 = MakeDriver(Bs), D2 = MakeDriver(Bs);
+  InstallDriver(Bs, D1, &Driver1);
+  InstallDriver(Bs, D2, &Driver2);
+
+  EXPECT_EQ(Bs->ConnectController(Bare, nullptr, nullptr, FALSE), EFI_NOT_FOUND);
+  EXPECT_EQ(Bs->ConnectController(Controller, nullptr, nullptr, FALSE), EFI_SUCCESS);
+  EXPECT_EQ(D1.Started + D2.Started, 1); // the first driver holds it by driver
+
+  // Nothing to stop is success; a foreign driver filter stops nobody.
+  EXPECT_EQ(Bs->DisconnectController(Bare, nullptr, nullptr), EFI_SUCCESS);
+  EFI_HANDLE Holder = D1.Started ? Driver1 : Driver2;
+  EFI_HANDLE Idle = D1.Started ? Driver2 : Driver1;
+  EXPECT_EQ(Bs->DisconnectController(Controller, Idle, nullptr), EFI_SUCCESS);
+  EXPECT_EQ(D1.Stopped + D2.Stopped, 0);
+  EXPECT_EQ(Bs->DisconnectController(Controller, Holder, nullptr), EFI_SUCCESS);
+  EXPECT_EQ(D1.Stopped + D2.Stopped, 1);
+
+  // Uninstalling a protocol held by driver asks the driver to stop first;
+  // a driver that does not let go makes the uninstall fail.
+  EFI_HANDLE Only[2] = {Driver1, nullptr};
+  ASSERT_EQ(Bs->ConnectController(Controller, Only, nullptr, FALSE), EFI_SUCCESS);
+  D1.CloseOnStop = false;
+  EXPECT_EQ(Bs->UninstallProtocolInterface(Controller, &kGuidA, &Ia), EFI_ACCESS_DENIED);
+  D1.CloseOnStop = true;
+  int StoppedBefore = D1.Stopped;
+  EXPECT_EQ(Bs->UninstallProtocolInterface(Controller, &kGuidA, &Ia), EFI_SUCCESS);
+  EXPECT_GT(D1.Stopped, StoppedBefore);
+
+  Bs->UninstallProtocolInterface(Bare, &kGuidB, &Ia);
+  Bs->UninstallProtocolInterface(Driver1, &gEfiDriverBindingProtocolGuid, &D1.Binding);
+  Bs->UninstallProtocolInterface(Driver2, &gEfiDriverBindingProtocolGuid, &D2.Binding);
+}
+
+TEST_F(HostEnv, ProtocolNotifyReportsEachNewInstanceOnce) {
+  NotifyLog Log;
+  Log.Bs = Bs;
+  EFI_EVENT Event = nullptr;
+  ASSERT_EQ(Bs->CreateEvent(EVT_NOTIFY_SIGNAL, TPL_CALLBACK, CountNotify, &Log, &Event),
+            EFI_SUCCESS);
+  void *Registration = nullptr;
+  ASSERT_EQ(Bs->RegisterProtocolNotify(&kGuidB, Event, &Registration), EFI_SUCCESS);
+  int Ib = 7;
+  EFI_HANDLE H = nullptr;
+  Bs->InstallProtocolInterface(&H, &kGuidB, EFI_NATIVE_INTERFACE, &Ib);
+  EXPECT_EQ(Log.Count, 1);
+  void *Interface = nullptr;
+  EXPECT_EQ(Bs->LocateProtocol(&kGuidB, Registration, &Interface), EFI_SUCCESS);
+  EXPECT_EQ(Interface, &Ib);
+  EXPECT_EQ(Bs->LocateProtocol(&kGuidB, Registration, &Interface), EFI_NOT_FOUND);
+  Bs->UninstallProtocolInterface(H, &kGuidB, &Ib);
+  Bs->CloseEvent(Event);
+}
+
+TEST_F(HostEnv, RunImageTakesItsProtocolsOffTheImageHandleAgain) {
+  char Name[] = "CIFSDrv.efi";
+  char *Argv[] = {Name, nullptr};
+  HostConsoleCaptureBegin();
+  HostRunImage(1, Argv);
+  HostConsoleCaptureEnd();
+  void *Interface = nullptr;
+  EXPECT_EQ(Bs->HandleProtocol(HostImageHandle(), &gEfiLoadedImageProtocolGuid, &Interface),
+            EFI_UNSUPPORTED);
+  EXPECT_EQ(Bs->HandleProtocol(HostImageHandle(), &gEfiShellParametersProtocolGuid, &Interface),
+            EFI_UNSUPPORTED);
+  HostShutdown();
+  EXPECT_EQ(HostRunImage(1, Argv), EFI_NOT_READY); // no environment
+  EXPECT_EQ(HostSystemTable(), nullptr);
+}
+
+// ---------------------------------------------------------------------------
+// Variables
+// ---------------------------------------------------------------------------
+TEST_F(HostEnv, VariablesRoundTripThroughTheStoreFile) {
+  const uint8_t Record[4] = {0x00, 0xFF, 0x10, 0xAB};
+  ASSERT_EQ(Rt->SetVariable(u"PROVISIONING_ENV_VAR", &kProvisioningGuid, 3, sizeof Record, Record),
+            EFI_SUCCESS);
+  const uint8_t Other[1] = {0x5A};
+  ASSERT_EQ(Rt->SetVariable(u"odd name%é", &kGuidA, 2, 1, Other), EFI_SUCCESS);
+
+  std::string Text = ReadStore();
+  EXPECT_EQ(Text[0], '#');
+  EXPECT_NE(Text.find("\n{4C4AC96B-DD0A-447E-8118-105900DA8629} PROVISIONING_ENV_VAR 3 00ff10ab\n"),
+            std::string::npos)
+      << Text;
+  EXPECT_NE(Text.find(" odd%20name%25\xC3\xA9 2 5a\n"), std::string::npos) << Text;
+
+  // Edit the file behind the environment's back and reload.
+  {
+    std::ofstream Out(StorePath, std::ios::app);
+    Out << "# a comment\n\nnot a variable line\n"
+        << "{11111111-2222-3333-4444-555555555552} Seeded 7 0102\n";
+  }
+  HostVariablesReload();
+  uint8_t Buffer[8] = {};
+  UINTN Size = sizeof Buffer;
+  UINT32 Attributes = 0;
+  ASSERT_EQ(Rt->GetVariable(u"Seeded", &kGuidB, &Attributes, &Size, Buffer), EFI_SUCCESS);
+  EXPECT_EQ(Attributes, 7u);
+  EXPECT_EQ(Size, 2u);
+  EXPECT_EQ(Buffer[1], 0x02);
+  Size = sizeof Buffer;
+  ASSERT_EQ(Rt->GetVariable(u"odd name%é", &kGuidA, nullptr, &Size, Buffer), EFI_SUCCESS);
+  EXPECT_EQ(Buffer[0], 0x5A);
+
+  // A fresh environment on the same file sees the same store.
+  HostShutdown();
+  HostConfig Config;
+  Config.RamfsDir = RamfsPath.c_str();
+  Config.VarStore = StorePath.c_str();
+  St = HostInitialize(Config);
+  Rt = St->RuntimeServices;
+  Size = sizeof Buffer;
+  ASSERT_EQ(Rt->GetVariable(u"PROVISIONING_ENV_VAR", &kProvisioningGuid, nullptr, &Size, Buffer),
+            EFI_SUCCESS);
+  EXPECT_EQ(0, memcmp(Buffer, Record, sizeof Record));
+}
+
+TEST_F(HostEnv, VariableServicesFollowFirmwareRules) {
+  const uint8_t Data[6] = {1, 2, 3, 4, 5, 6};
+  ASSERT_EQ(Rt->SetVariable(u"V", &kGuidA, 3, 6, Data), EFI_SUCCESS);
+  uint8_t Small[2];
+  UINTN Size = sizeof Small;
+  EXPECT_EQ(Rt->GetVariable(u"V", &kGuidA, nullptr, &Size, Small), EFI_BUFFER_TOO_SMALL);
+  EXPECT_EQ(Size, 6u);
+  EXPECT_EQ(Rt->GetVariable(u"V", &kGuidB, nullptr, &Size, Small), EFI_NOT_FOUND);
+  EXPECT_EQ(Rt->GetVariable(u"V", &kGuidA, nullptr, &Size, nullptr), EFI_INVALID_PARAMETER);
+
+  EXPECT_EQ(Rt->SetVariable(u"V", &kGuidA, 2, 6, Data), EFI_INVALID_PARAMETER); // other attributes
+  EXPECT_EQ(Rt->SetVariable(u"V", &kGuidA, EFI_VARIABLE_RUNTIME_ACCESS, 6, Data),
+            EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Rt->SetVariable(u"", &kGuidA, 3, 6, Data), EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Rt->SetVariable(u"V", &kGuidA, 3, 6, nullptr), EFI_INVALID_PARAMETER);
+
+  EXPECT_EQ(Rt->SetVariable(u"V", &kGuidA, 3 | 0x40, 2, Data), EFI_SUCCESS); // append
+  uint8_t Big[16];
+  Size = sizeof Big;
+  EXPECT_EQ(Rt->GetVariable(u"V", &kGuidA, nullptr, &Size, Big), EFI_SUCCESS);
+  EXPECT_EQ(Size, 8u);
+  EXPECT_EQ(Big[7], 2);
+
+  EXPECT_EQ(Rt->SetVariable(u"V", &kGuidA, 3, 0, nullptr), EFI_SUCCESS); // delete by size 0
+  EXPECT_EQ(Rt->SetVariable(u"V", &kGuidA, 3, 0, nullptr), EFI_NOT_FOUND);
+  ASSERT_EQ(Rt->SetVariable(u"W", &kGuidA, 2, 1, Data), EFI_SUCCESS);
+  EXPECT_EQ(Rt->SetVariable(u"W", &kGuidA, 0, 1, Data), EFI_SUCCESS); // delete by attributes 0
+  EXPECT_EQ(ReadStore().find(" W "), std::string::npos);
+}
+
+TEST_F(HostEnv, GetNextVariableNameWalksEveryVariableOnce) {
+  const uint8_t Byte = 1;
+  Rt->SetVariable(u"First", &kGuidA, 3, 1, &Byte);
+  Rt->SetVariable(u"SecondLongerName", &kGuidB, 2, 1, &Byte);
+  Rt->SetVariable(u"Third", &kGuidA, 3, 1, &Byte);
+
+  CHAR16 Name[64] = {0};
+  EFI_GUID Guid = {};
+  std::vector<std::u16string> Seen;
+  for (;;) {
+    UINTN Size = sizeof Name;
+    EFI_STATUS Status = Rt->GetNextVariableName(&Size, Name, &Guid);
+    if (Status == EFI_NOT_FOUND) {
+      break;
+    }
+    ASSERT_EQ(Status, EFI_SUCCESS);
+    EXPECT_EQ(Size, (std::u16string(Name).size() + 1) * 2);
+    Seen.push_back(Name);
+  }
+  EXPECT_EQ(Seen, (std::vector<std::u16string>{u"First", u"SecondLongerName", u"Third"}));
+
+  // A too-small buffer reports the size and leaves the cursor in place.
+  CHAR16 Cursor[16] = u"First";
+  Guid = kGuidA;
+  UINTN Size = 12;
+  EXPECT_EQ(Rt->GetNextVariableName(&Size, Cursor, &Guid), EFI_BUFFER_TOO_SMALL);
+  EXPECT_EQ(Size, sizeof(u"SecondLongerName"));
+  Size = sizeof Cursor;
+  CHAR16 Unknown[16] = u"Nope";
+  EXPECT_EQ(Rt->GetNextVariableName(&Size, Unknown, &Guid), EFI_INVALID_PARAMETER);
+}
+
+// ---------------------------------------------------------------------------
+// Console, clock, configuration tables, collation
+// ---------------------------------------------------------------------------
+TEST_F(HostEnv, ConsoleWritesUtf8ExactlyAsPrinted) {
+  HostConsoleCaptureBegin();
+  St->ConOut->OutputString(St->ConOut, u"line\nnext\r\n");
+  St->ConOut->OutputString(St->ConOut, u"caf\u00e9 \u20ac");
+  std::string Text = HostConsoleCaptureEnd();
+  EXPECT_EQ(Text, "line\nnext\r\ncaf\xC3\xA9 \xE2\x82\xAC");
+  HostConsoleCaptureBegin();
+  EXPECT_STREQ(HostConsoleCaptureEnd(), "");
+}
+
+TEST_F(HostEnv, GetTimeReportsLocalTimeWithUnspecifiedZone) {
+  EFI_TIME Time = {};
+  ASSERT_EQ(Rt->GetTime(&Time, nullptr), EFI_SUCCESS);
+  EXPECT_GE(Time.Year, 2020);
+  EXPECT_GE(Time.Month, 1);
+  EXPECT_LE(Time.Month, 12);
+  EXPECT_EQ(Time.TimeZone, 2047);
+  EXPECT_EQ(Time.Daylight, 0);
+  EXPECT_EQ(Rt->GetTime(nullptr, nullptr), EFI_INVALID_PARAMETER);
+}
+
+void *FindTable(EFI_SYSTEM_TABLE *St, const EFI_GUID &Guid) {
+  for (UINTN I = 0; I < St->NumberOfTableEntries; I++) {
+    if (EfiGuidEqual(St->ConfigurationTable[I].VendorGuid, Guid)) {
+      return St->ConfigurationTable[I].VendorTable;
+    }
+  }
+  return nullptr;
+}
+
+TEST_F(HostEnv, IpmiTransportFailsAsScriptedThenAnswers) {
+  EXPECT_EQ(FindTable(St, gIpmiTransportTableGuid), nullptr);
+  HostIpmiConfig Config;
+  Config.Enabled = true;
+  Config.Response[0] = 0x00;
+  Config.Response[1] = 0x00;
+  Config.Response[6] = 0x42;
+  Config.ResponseLength = 8;
+  Config.SendStatus = EFI_DEVICE_ERROR;
+  Config.FailCount = 2;
+  HostSetIpmi(Config);
+  auto *Ipmi = static_cast<IPMI_TRANSPORT *>(FindTable(St, gIpmiTransportTableGuid));
+  ASSERT_NE(Ipmi, nullptr);
+
+  UINT8 Request[4] = {0x12, 0, 0, 0};
+  UINT8 Response[256] = {};
+  UINT32 Length = 32;
+  EXPECT_EQ(Ipmi->SendIpmiCommand(Ipmi, 0x30, 0, 0xA9, Request, 4, Response, &Length),
+            EFI_DEVICE_ERROR);
+  EXPECT_EQ(Ipmi->SendIpmiCommand(Ipmi, 0x30, 0, 0xA9, Request, 4, Response, &Length),
+            EFI_DEVICE_ERROR);
+  EXPECT_EQ(Ipmi->SendIpmiCommand(Ipmi, 0x30, 0, 0xA9, Request, 4, Response, &Length), EFI_SUCCESS);
+  EXPECT_EQ(Length, 8u);
+  EXPECT_EQ(Response[6], 0x42);
+  EXPECT_EQ(HostIpmiRequestCount(), 3u);
+  HostIpmiRequest Last = HostIpmiLastRequest();
+  EXPECT_EQ(Last.NetFn, 0x30);
+  EXPECT_EQ(Last.Command, 0xA9);
+  EXPECT_EQ(Last.DataLength, 4u);
+  EXPECT_EQ(Last.Data[0], 0x12);
+
+  Length = 4; // an answer that does not fit
+  EXPECT_EQ(Ipmi->SendIpmiCommand(Ipmi, 0x30, 0, 0xA9, Request, 4, Response, &Length),
+            EFI_BUFFER_TOO_SMALL);
+  EXPECT_EQ(Length, 8u);
+}
+
+struct SmbiosStructure {
+  const uint8_t *Formatted;
+  std::vector<std::string> Strings;
+};
+
+// Walks the structure table from the 2.x entry point, checking the entry
+// point's checksums and that the walk ends exactly at the table's end with
+// the type-127 record. Empty when anything is off.
+std::vector<SmbiosStructure> WalkSmbios(EFI_SYSTEM_TABLE *St) {
+  const uint8_t *Entry = static_cast<const uint8_t *>(FindTable(St, gEfiSmbiosTableGuid));
+  if (Entry == nullptr || memcmp(Entry, "_SM_", 4) != 0 || memcmp(Entry + 16, "_DMI_", 5) != 0) {
+    return {};
+  }
+  uint8_t Sum = 0, Intermediate = 0;
+  for (int I = 0; I < Entry[5]; I++) {
+    Sum = static_cast<uint8_t>(Sum + Entry[I]);
+    Intermediate = static_cast<uint8_t>(Intermediate + (I >= 16 ? Entry[I] : 0));
+  }
+  uint16_t Length, Count;
+  uint32_t Address;
+  memcpy(&Length, Entry + 22, 2);
+  memcpy(&Address, Entry + 24, 4);
+  memcpy(&Count, Entry + 28, 2);
+  if (Sum != 0 || Intermediate != 0) {
+    return {};
+  }
+  const uint8_t *P = reinterpret_cast<const uint8_t *>(static_cast<uintptr_t>(Address));
+  const uint8_t *End = P + Length;
+  std::vector<SmbiosStructure> Found;
+  while (P + 4 <= End && P[1] >= 4) {
+    SmbiosStructure S{P, {}};
+    const char *Text = reinterpret_cast<const char *>(P + P[1]);
+    if (*Text == 0) {
+      Text++; // no strings: the set is two NULs
+    }
+    while (reinterpret_cast<const uint8_t *>(Text) < End && *Text != 0) {
+      S.Strings.push_back(Text);
+      Text += strlen(Text) + 1;
+    }
+    P = reinterpret_cast<const uint8_t *>(Text) + 1;
+    Found.push_back(S);
+    if (S.Formatted[0] == 127) {
+      break;
+    }
+  }
+  if (P != End || Found.size() != Count || Found.back().Formatted[0] != 127) {
+    return {};
+  }
+  return Found;
+}
+
+// String number Formatted[Offset] of the first structure of the type.
+std::string SmbiosString(EFI_SYSTEM_TABLE *St, uint8_t Type, uint8_t Offset) {
+  for (const SmbiosStructure &S : WalkSmbios(St)) {
+    if (S.Formatted[0] == Type) {
+      uint8_t Index = S.Formatted[Offset];
+      return Index == 0 ? "" : Index <= S.Strings.size() ? S.Strings[Index - 1] : "<bad index>";
+    }
+  }
+  return "<none>";
+}
+
+TEST_F(HostEnv, SmbiosCarriesSerialNumberAndSettableAssetTag) {
+  EXPECT_EQ(SmbiosString(St, 1, 7), "HOSTSVC1");
+  EXPECT_EQ(SmbiosString(St, 3, 8), "HOSTASSET");
+  HostSetSmbiosAssetTag("RACK-17");
+  EXPECT_EQ(SmbiosString(St, 3, 8), "RACK-17");
+  EXPECT_EQ(SmbiosString(St, 1, 7), "HOSTSVC1");
+  HostSetSmbiosAssetTag("");
+  EXPECT_EQ(SmbiosString(St, 3, 8), "");
+  HostSetSmbiosAssetTag(nullptr);
+  EXPECT_EQ(SmbiosString(St, 3, 8), "<none>");
+}
+
+TEST_F(HostEnv, CollationMatchesCaseInsensitively) {
+  EFI_UNICODE_COLLATION_PROTOCOL *Coll = nullptr;
+  ASSERT_EQ(Bs->LocateProtocol(&gEfiUnicodeCollation2ProtocolGuid, nullptr,
+                               reinterpret_cast<void **>(&Coll)),
+            EFI_SUCCESS);
+  EXPECT_EQ(strncmp(Coll->SupportedLanguages, "eng", 3), 0);
+
+  CHAR16 A[] = u"Catalog.XML", B[] = u"catalog.xml", C[] = u"catalog.xmm";
+  EXPECT_EQ(Coll->StriColl(Coll, A, B), 0);
+  EXPECT_LT(Coll->StriColl(Coll, B, C), 0);
+
+  struct Case {
+    const char16_t *String, *Pattern;
+    bool Match;
+  } Cases[] = {
+      {u"catalog.xml.gz", u"*.XML.GZ", true},
+      {u"catalog.xml", u"*.xml.gz", false},
+      {u"abc", u"a?c", true},
+      {u"ac", u"a?c", false},
+      {u"file7", u"file[0-9]", true},
+      {u"fileX", u"file[0-9]", false},
+      {u"Bx", u"[abc]x", true},
+      {u"a", u"[a", false},
+      {u"aaab", u"*a*b", true},
+      {u"", u"*", true},
+      {u"anything", u"", false},
+      {u"mississippi", u"m*iss*ppi", true},
+  };
+  for (const Case &K : Cases) {
+    std::u16string S = K.String, P = K.Pattern;
+    EXPECT_EQ(Coll->MetaiMatch(Coll, &S[0], &P[0]) != 0, K.Match)
+        << std::string(S.begin(), S.end()) << " ~ " << std::string(P.begin(), P.end());
+  }
+
+  CHAR16 Mixed[] = u"MiXeD\u00e9";
+  Coll->StrUpr(Coll, Mixed);
+  EXPECT_EQ(std::u16string(Mixed), u"MIXED\u00c9");
+  Coll->StrLwr(Coll, Mixed);
+  EXPECT_EQ(std::u16string(Mixed), u"mixed\u00e9");
+
+  CHAR8 Fat[12] = {};
+  CHAR16 Name[] = u"a b.c*d";
+  EXPECT_TRUE(Coll->StrToFat(Coll, Name, 11, Fat));
+  EXPECT_STREQ(Fat, "ABC_D");
+  CHAR16 Back[12];
+  Coll->FatToStr(Coll, 3, Fat, Back);
+  EXPECT_EQ(std::u16string(Back), u"ABC");
+}
+
+} // namespace
