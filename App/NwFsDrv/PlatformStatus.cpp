@@ -21,7 +21,7 @@ constexpr UINT32 kFirstStatusIndex = 6;
 constexpr UINT32 kSecondStatusIndex = 2;
 
 EFI_STATUS ExitGetPMStatus(EFI_STATUS Status) {
-  DiagLog(DIAG_TRACE, "\nExiting GetPMStatus() with Success\n");
+  DiagLog(DIAG_ALWAYS, "\nExiting GetPMStatus() with Success\n");
   return Status;
 }
 
@@ -67,8 +67,8 @@ IPMI_TRANSPORT *LocateIpmiTransport(EFI_SYSTEM_TABLE *SystemTable) {
 }
 
 EFI_STATUS GetPMStatus(UINT8 *FirstStatus, UINT8 *SecondStatus) {
-  DiagLog(DIAG_TRACE, "Entering GetPMStatus()\n");
-  DiagLog(DIAG_VERBOSE, "Command Data 0:%x, 1:%x, 2:%x  3:%x\n", kPmRequest[0], kPmRequest[1],
+  DiagLog(DIAG_ALWAYS, "Entering GetPMStatus()\n");
+  DiagLog(DIAG_ALWAYS, "Command Data 0:%x, 1:%x, 2:%x  3:%x\n", kPmRequest[0], kPmRequest[1],
           kPmRequest[2], kPmRequest[3]);
   if (FirstStatus == nullptr || SecondStatus == nullptr) {
     return ExitGetPMStatus(EFI_INVALID_PARAMETER);
@@ -85,13 +85,13 @@ EFI_STATUS GetPMStatus(UINT8 *FirstStatus, UINT8 *SecondStatus) {
   if (Status != EFI_SUCCESS) {
     return ExitGetPMStatus(Status);
   }
-  DiagLog(DIAG_VERBOSE, "SendIpmiCommand completion code: 0x%X\n",
+  DiagLog(DIAG_ALWAYS, "SendIpmiCommand completion code: 0x%X\n",
           gIpmiTransport->CommandCompletionCode);
-  DiagLog(DIAG_VERBOSE, "SendIpmiCommand EFI Status: 0x%X\n", static_cast<UINT32>(Status));
+  DiagLog(DIAG_ALWAYS, "SendIpmiCommand EFI Status: 0x%X\n", static_cast<UINT32>(Status));
   if (Response[kResponseOkIndex] == 0) {
-    DiagLog(DIAG_VERBOSE, "ResponseData :");
+    DiagLog(DIAG_ALWAYS, "ResponseData :");
     for (UINT32 Index = 0; Index < Received; Index++) {
-      DiagLog(DIAG_VERBOSE, " [%X]= 0x%X", Index, Response[Index]);
+      DiagLog(DIAG_ALWAYS, " [%X]= 0x%X", Index, Response[Index]);
     }
     // Bytes the controller did not send stay 0.
     if (Received > kFirstStatusIndex) {

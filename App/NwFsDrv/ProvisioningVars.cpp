@@ -100,7 +100,7 @@ bool IsNvramStringValid(const CHAR8 *Text, UINTN Room) {
     return true;
   }
   // The printed copy stops at the NUL or at the end of the caller's record.
-  DiagLog(DIAG_VERBOSE, "String - %.*s\n", static_cast<int>(AsciiStrnLen(Text, Room)), Text);
+  DiagLog(DIAG_ALWAYS, "String - %.*s\n", static_cast<int>(AsciiStrnLen(Text, Room)), Text);
   UINTN Limit = Room < PROVISIONING_TEXT_BYTES ? Room : PROVISIONING_TEXT_BYTES;
   for (UINTN Index = 0; Index < Limit && Text[Index] != 0; Index++) {
     UINT8 Byte = static_cast<UINT8>(Text[Index]);

@@ -124,7 +124,7 @@ EFI_STATUS AddMapDevice(const CHAR16 *Name, const UINT8 *Data, UINTN Size) {
     return EFI_OUT_OF_RESOURCES;
   }
   Device->DevicePathSize = Size;
-  DiagLog(DIAG_VERBOSE, "pDev->MapName = %a\n", Device->MapName);
+  DiagLog(DIAG_ALWAYS, "pDev->MapName = %a\n", Device->MapName);
   NWFS_MAP_DEVICE **Tail = &gMapDeviceList;
   while (*Tail != nullptr) {
     Tail = &(*Tail)->Next;
@@ -162,8 +162,8 @@ EFI_STATUS ReadEnumeratedVariable(const CHAR16 *Name, const EFI_GUID &Guid, void
   *Size = *Capacity;
   EFI_STATUS Status = gRT->GetVariable(Name, &Guid, nullptr, Size, *Data);
   if (Status == EFI_BUFFER_TOO_SMALL) {
-    DiagLog(DIAG_VERBOSE, "Get variable returned buffer too small\n");
-    DiagLog(DIAG_VERBOSE, "VariableDataSize = %d\n", static_cast<INT32>(*Size));
+    DiagLog(DIAG_ALWAYS, "Get variable returned buffer too small\n");
+    DiagLog(DIAG_ALWAYS, "VariableDataSize = %d\n", static_cast<INT32>(*Size));
     if (!GrowBuffer(Data, *Size, 0)) {
       return EFI_OUT_OF_RESOURCES;
     }
@@ -221,7 +221,7 @@ UINTN NwEnvCount() {
 }
 
 EFI_STATUS _InitializeEnv() {
-  DiagLog(DIAG_TRACE, "\nEntered _InitializeEnv\n");
+  DiagLog(DIAG_ALWAYS, "\nEntered _InitializeEnv\n");
   if (gRT == nullptr) {
     return EFI_NOT_READY;
   }

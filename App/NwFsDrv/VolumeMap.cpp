@@ -41,7 +41,7 @@ EFI_STATUS ReadFileSystemInfo(EFI_FILE_PROTOCOL *Root, EFI_FILE_SYSTEM_INFO **In
   }
   EFI_STATUS Status = Root->GetInfo(Root, &gEfiFileSystemInfoGuid, &Size, *Info);
   if (Status == EFI_BUFFER_TOO_SMALL) {
-    DiagLog(DIAG_VERBOSE, "RootFs->GetInfo return Buffer small. Status = 0x%x\n",
+    DiagLog(DIAG_ALWAYS, "RootFs->GetInfo return Buffer small. Status = 0x%x\n",
             static_cast<UINT32>(Status));
     FreePool(*Info);
     *Info = static_cast<EFI_FILE_SYSTEM_INFO *>(AllocateZeroPool(Size));
@@ -55,8 +55,7 @@ EFI_STATUS ReadFileSystemInfo(EFI_FILE_PROTOCOL *Root, EFI_FILE_SYSTEM_INFO **In
   if (EFI_ERROR(Status)) {
     DiagLog(DIAG_ALWAYS, "RootFs->GetInfo failed. Status = 0x%x\n", static_cast<UINT32>(Status));
   } else {
-    DiagLog(DIAG_VERBOSE, "RootFs->GetInfo succeeded. Status = 0x%x\n",
-            static_cast<UINT32>(Status));
+    DiagLog(DIAG_ALWAYS, "RootFs->GetInfo succeeded. Status = 0x%x\n", static_cast<UINT32>(Status));
   }
   return Status;
 }
@@ -75,9 +74,9 @@ void CopyVolumeLabel(const EFI_FILE_SYSTEM_INFO *Info, UINTN Allocated, CHAR16 *
   Label[Index] = 0;
 }
 
-// The first of the shell's ';'-separated names for a device path, without
-// its trailing ':'. EFI_BUFFER_TOO_SMALL when it does not fit Capacity.
-EFI_STATUS FirstShellName(const CHAR16 *Names, CHAR16 *ShellName, UINTN Capacity) {
+// Length of the first of the shell's ';'-separated names for a device path,
+// without its trailing ':'.
+UINTN FirstShellNameLength(const CHAR16 *Names) {
   UINTN Length = 0;
   while (Names[Length] != 0 && Names[Length] != u';') {
     Length++;
@@ -85,12 +84,7 @@ EFI_STATUS FirstShellName(const CHAR16 *Names, CHAR16 *ShellName, UINTN Capacity
   if (Length > 0 && Names[Length - 1] == u':') {
     Length--;
   }
-  if (Length >= Capacity) {
-    return EFI_BUFFER_TOO_SMALL;
-  }
-  CopyMem(ShellName, Names, Length * sizeof(CHAR16));
-  ShellName[Length] = 0;
-  return EFI_SUCCESS;
+  return Length;
 }
 
 // The handle among Handles whose volume label agrees with VolumeName, or
@@ -112,13 +106,13 @@ EFI_HANDLE FindVolumeByLabel(const CHAR16 *VolumeName, EFI_HANDLE *Handles, UINT
     }
     Label[0] = 0;
     GetVolume(Handles[Index], Label);
-    DiagLogW(DIAG_VERBOSE, u"partitionLabel = %s\n", Label);
-    DiagLogW(DIAG_VERBOSE, u"volumeName = %s\n", VolumeName);
+    DiagLogW(DIAG_ALWAYS, u"partitionLabel = %s\n", Label);
+    DiagLogW(DIAG_ALWAYS, u"volumeName = %s\n", VolumeName);
     if (LabelsAgree(Label, VolumeName)) {
       *DevicePath = Path;
       return Handles[Index];
     }
-    DiagLogW(DIAG_VERBOSE, u"Checking failed for %s vs %s\n", Label, VolumeName);
+    DiagLogW(DIAG_ALWAYS, u"Checking failed for %s vs %s\n", Label, VolumeName);
   }
   return nullptr;
 }
@@ -141,10 +135,10 @@ bool MapFromPartitionTable(const CHAR16 *VolumeName, const CHAR16 *ShellName, CH
                            UINTN DriveNameChars) {
   for (const NWFS_PARTITION_LABEL &Row : gPartitionLabelTable) {
     if (!LabelsAgree(Row.Label, VolumeName)) {
-      DiagLogW(DIAG_VERBOSE, u"Did not map, wrong partition name: %s\n", Row.Label);
+      DiagLogW(DIAG_ALWAYS, u"Did not map, wrong partition name: %s\n", Row.Label);
       continue;
     }
-    DiagLogW(DIAG_VERBOSE, u"Mapped %s to %s\n", ShellName, Row.MapName);
+    DiagLogW(DIAG_ALWAYS, u"Mapped %s to %s\n", ShellName, Row.MapName);
     RunMapCommand(u"map %s %s:", Row.MapName, ShellName);
     CHAR16 Command[kCommandChars];
     UnicodeSPrint(Command, kCommandChars, u"vol %s:", ShellName);
@@ -162,7 +156,7 @@ void MapUnderWantedName(const CHAR16 *VolumeName, const CHAR16 *ShellName, CHAR1
   if (RunMapCommand(u"map %s %s:", VolumeName, ShellName) == 0 &&
       StrLen(VolumeName) < DriveNameChars) {
     StrCpyS(DriveName, DriveNameChars, VolumeName);
-    DiagLogW(DIAG_VERBOSE, u"Mapping successful. Copying volumeName: %s to driveName: %s.\n",
+    DiagLogW(DIAG_ALWAYS, u"Mapping successful. Copying volumeName: %s to driveName: %s.\n",
              VolumeName, DriveName);
     return;
   }
@@ -194,13 +188,17 @@ EFI_STATUS MapFoundVolume(EFI_SHELL_PROTOCOL *Shell, EFI_DEVICE_PATH_PROTOCOL *D
             static_cast<UINT32>(EFI_NOT_FOUND));
     return EFI_NOT_FOUND;
   }
-  DiagLogW(DIAG_VERBOSE, u"FSName: %s\n", Names);
+  // The volume's shell name is the first of the names the shell knows it by.
+  const UINTN Length = FirstShellNameLength(Names);
+  DiagLogW(DIAG_ALWAYS, u"FSName: %.*s\n", static_cast<int>(Length), Names);
   // The shell name buffer holds NWFS_DRIVE_NAME_CHARS characters at most.
   UINTN Capacity = DriveNameChars < NWFS_DRIVE_NAME_CHARS ? DriveNameChars : NWFS_DRIVE_NAME_CHARS;
-  if (EFI_ERROR(FirstShellName(Names, ShellName, Capacity))) {
+  if (Length >= Capacity) {
     DiagLog(DIAG_ALWAYS, "FSName is too long\n");
     return EFI_BUFFER_TOO_SMALL;
   }
+  CopyMem(ShellName, Names, Length * sizeof(CHAR16));
+  ShellName[Length] = 0;
   if (!MapFromPartitionTable(VolumeName, ShellName, DriveName, DriveNameChars)) {
     MapUnderWantedName(VolumeName, ShellName, DriveName, DriveNameChars);
   }
@@ -232,7 +230,7 @@ EFI_STATUS GetVolume(EFI_HANDLE Handle, CHAR16 *Label) {
   }
   FreePool(Info);
   Root->Close(Root);
-  DiagLog(DIAG_TRACE, "Exiting from GetVolume() function \n");
+  DiagLog(DIAG_ALWAYS, "Exiting from GetVolume() function \n");
   return Status;
 }
 
@@ -270,6 +268,6 @@ EFI_STATUS GetFS_OLD_NWFS(const CHAR16 *VolumeName, CHAR16 *DriveName, UINTN Dri
   FreePool(Label);
   FreePool(ShellName);
   FreePool(Handles);
-  DiagLogW(DIAG_TRACE, u"Exiting from %a function \n", "GetFS_OLD_NWFS");
+  DiagLogW(DIAG_ALWAYS, u"Exiting from %a function \n", "GetFS_OLD_NWFS");
   return Status;
 }

@@ -248,6 +248,23 @@ TEST_F(ProvisioningVarsTest, PlatformStatusRequestAndAnswer) {
   EXPECT_EQ(Second, 0x22);
 }
 
+TEST_F(ProvisioningVarsTest, PlatformStatusAndStringCheckLinesIgnoreTheDebugLevel) {
+  gDriverDebugLevel = 0;
+  UseIpmi({0x00, 0x00, 0x22, 0x00, 0x00, 0x00, 0x66});
+  UINT8 First = 0, Second = 0;
+  std::string Out = Console([&] {
+    EXPECT_EQ(GetPMStatus(&First, &Second), EFI_SUCCESS);
+    EXPECT_TRUE(IsNvramStringValid("host.example"));
+  });
+  EXPECT_EQ(Out, "Entering GetPMStatus()\n"
+                 "Command Data 0:12, 1:0, 2:0  3:0\n"
+                 "SendIpmiCommand completion code: 0x0\n"
+                 "SendIpmiCommand EFI Status: 0x0\n"
+                 "ResponseData : [0]= 0x0 [1]= 0x0 [2]= 0x22 [3]= 0x0 [4]= 0x0 [5]= 0x0 [6]= 0x66"
+                 "\nExiting GetPMStatus() with Success\n"
+                 "String - host.example\n");
+}
+
 TEST_F(ProvisioningVarsTest, PlatformStatusRetriesAfterAFailedSend) {
   UseIpmi({0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x05}, EFI_DEVICE_ERROR, 1);
   uint32_t Before = HostIpmiRequestCount();

@@ -203,7 +203,22 @@ TEST_F(ShellCommandTest, LookupComparesTheFirstSixCharactersOfTheLabel) {
   EXPECT_EQ(Lookup(u"ramfsX"), u""); // the sixth character differs from the end
   FakeVolume *Data = AddVolume(u"MYDATA-VOLUME", 0xD0);
   RefreshShellMappings();
-  EXPECT_EQ(Lookup(u"MYDATA"), u"MYDATA");
+  // The lookup's own lines carry no level; only its entry trace does.
+  gDriverDebugLevel = 0;
+  std::string Out;
+  EXPECT_EQ(Lookup(u"MYDATA", &Out), u"MYDATA");
+  EXPECT_NE(Out.find("partitionLabel = MYDATA-VOLUME\nvolumeName = MYDATA\n"), std::string::npos);
+  EXPECT_NE(Out.find("Mapping successful. Copying volumeName: MYDATA to driveName: MYDATA.\n"),
+            std::string::npos);
+  EXPECT_NE(Out.find("Exiting from GetFS_OLD_NWFS function \n"), std::string::npos);
+  // The shell name is printed alone, without its ':' or the shell's other names.
+  EFI_DEVICE_PATH_PROTOCOL *Cursor = &Data->Path.Header;
+  std::u16string Names = gShellEnv2->GetMapFromDevicePath(&Cursor);
+  std::u16string First = Names.substr(0, Names.find(u':'));
+  EXPECT_NE(Out.find("FSName: " + std::string(First.begin(), First.end()) + "\n"),
+            std::string::npos)
+      << Out;
+  EXPECT_EQ(Out.find("Entered"), std::string::npos);
   EXPECT_EQ(Data->OpenRoots, 0);
   EXPECT_NE(gShellEnv2->GetDevicePathFromMap(u"MYDATA:"), nullptr);
   EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);

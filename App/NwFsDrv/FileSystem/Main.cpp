@@ -61,14 +61,23 @@ void FreeArguments(MAIN_ARGUMENTS *Arguments) {
   }
 }
 
+// Without runtime services nothing is read, and the empty size marks the
+// read as failed.
 EFI_STATUS ReadOutcome(PROVISIONING_OUTCOME_RECORD *Record, UINTN *DataSize) {
   ZeroMem(Record, sizeof(*Record));
+  if (gRT == nullptr) {
+    *DataSize = 0;
+    return EFI_NOT_READY;
+  }
   *DataSize = sizeof(*Record);
   return gRT->GetVariable(PROVISIONING_VOLATILE_VAR_NAME, &gProvisioningEnvGuid, nullptr, DataSize,
                           Record);
 }
 
 EFI_STATUS WriteOutcome(const PROVISIONING_OUTCOME_RECORD &Record) {
+  if (gRT == nullptr) {
+    return EFI_NOT_READY;
+  }
   return gRT->SetVariable(PROVISIONING_VOLATILE_VAR_NAME, &gProvisioningEnvGuid,
                           PROVISIONING_VOLATILE_ATTRIBUTES, sizeof(Record), &Record);
 }

@@ -19,14 +19,16 @@ static_assert(offsetof(NWFS_SHELL_INTERFACE, Argv) == 16, "shell interface Argv"
 static_assert(offsetof(NWFS_SHELL_INTERFACE, Argc) == 24, "shell interface Argc");
 
 // The UCS-2 command line as 8-bit copies, null-terminated. An argument that
-// cannot be copied stays null and is refused by the argument check.
+// is missing (or a missing vector) or cannot be copied stays null and is
+// refused by the argument check.
 CHAR8 **NarrowArguments(UINTN Argc, CHAR16 **Argv) {
   CHAR8 **Narrow = static_cast<CHAR8 **>(AllocateZeroPool((Argc + 1) * sizeof(CHAR8 *)));
   if (Narrow == nullptr) {
     return nullptr;
   }
   for (UINTN Index = 0; Index < Argc; Index++) {
-    Narrow[Index] = Argv[Index] != nullptr ? UnicodeStrDupToAscii(Argv[Index]) : nullptr;
+    const CHAR16 *Wide = Argv != nullptr ? Argv[Index] : nullptr;
+    Narrow[Index] = Wide != nullptr ? UnicodeStrDupToAscii(Wide) : nullptr;
   }
   return Narrow;
 }
