@@ -82,6 +82,13 @@ e2e_var_starts() {
   [[ "${value#* }" == "$3"* ]]
 }
 
+# The variable's first data byte is not zero.
+e2e_var_first_byte_nonzero() {
+  local value
+  value=$(e2e_var "$1" "$2")
+  [[ -n "$value" && "${value#* }" != 00* ]]
+}
+
 e2e_finish() {
   echo "$E2E_PASSED passed, $E2E_FAILED failed"
   [[ "$E2E_FAILED" == 0 ]]
