@@ -1,15 +1,17 @@
 #!/usr/bin/env bash
 # Installs the Debian packages that the build and the tests need: compilers
-# and build tools, the firmware image's toolchain (clang, lld-link), QEMU and
-# OVMF with mtools for the boot test, OpenSSL and GoogleTest for the hosted
-# build, Samba and tshark for the network tests.
+# and build tools, the firmware image's toolchain (clang, lld-link, gnu-efi's
+# protocol headers; make, perl and dpkg-dev to fetch and prepare OpenSSL's
+# sources for the image), QEMU and OVMF with mtools for the firmware tests,
+# OpenSSL and GoogleTest for the hosted build, Samba and tshark for the
+# network tests.
 #
 # Idempotent: when every package is already installed, apt is not run at all.
 # Works as root (no sudo needed), without a terminal and with CI=true.
 set -euo pipefail
 
 PACKAGES=(
-  cmake ninja-build g++ clang lld gnu-efi
+  cmake ninja-build g++ clang lld gnu-efi make perl dpkg-dev
   libssl-dev googletest libgtest-dev
   qemu-system-x86 ovmf mtools
   samba smbclient tshark

@@ -27,14 +27,15 @@ fw_write_startup() {
   sed 's/$/\r/' >"$1"
 }
 
-# fw_make_disk IMAGE EFI STARTUP: a 16 MiB FAT disk, without partition table,
-# holding the image and the startup script in its root.
+# fw_make_disk IMAGE EFI STARTUP [NAME]: a 16 MiB FAT disk, without partition
+# table, holding the image (as NAME, by default CIFSDrv.efi) and the startup
+# script in its root.
 fw_make_disk() {
-  local disk=$1 efi=$2 startup=$3
+  local disk=$1 efi=$2 startup=$3 name=${4:-CIFSDrv.efi}
   rm -f "$disk"
   truncate -s 16M "$disk"
   mformat -i "$disk" -v CIFSBOOT :: || fw_die "mformat failed"
-  mcopy -i "$disk" "$efi" ::/CIFSDrv.efi || fw_die "mcopy of the image failed"
+  mcopy -i "$disk" "$efi" "::/$name" || fw_die "mcopy of the image failed"
   mcopy -i "$disk" "$startup" ::/startup.nsh || fw_die "mcopy of startup.nsh failed"
 }
 
@@ -56,6 +57,28 @@ fw_key_feeder() {
   exec sleep 600
 }
 
+# fw_start_work NAME: a fresh work directory in $WORK, removed at exit unless
+# KEEP_WORK=1 by then; processes whose ids are in FW_CLEANUP_PIDS are stopped
+# at exit as well (with the key feeder).
+fw_start_work() {
+  WORK=$(mktemp -d "${TMPDIR:-/tmp}/cifsdrv-$1.XXXXXX")
+  KEEP_WORK=0
+  FW_CLEANUP_PIDS=()
+  trap fw_cleanup_work EXIT
+}
+
+fw_cleanup_work() {
+  local pid
+  fw_stop_feeder
+  for pid in "${FW_CLEANUP_PIDS[@]}"; do
+    kill "$pid" 2>/dev/null || true
+    wait "$pid" 2>/dev/null || true
+  done
+  if [ "$KEEP_WORK" -eq 0 ]; then
+    rm -rf "$WORK"
+  fi
+}
+
 fw_stop_feeder() {
   if [ -n "$FW_FEEDER_PID" ]; then
     kill "$FW_FEEDER_PID" 2>/dev/null || true
@@ -69,9 +92,14 @@ fw_stop_feeder() {
 # to WORK/serial.log and takes its input from the key feeder. A processor
 # exception ends the run at once instead of waiting for the time limit, since
 # the firmware halts after reporting one. Returns QEMU's status (124 when the
-# time limit ended it).
+# time limit ended it). The array FW_QEMU_ARGS, when set, replaces the
+# default "-net none" (devices such as a NIC or an RNG; processor model).
 fw_boot() {
   local work=$1 limit=$2 rc=0 qemu_pid
+  local -a extra=(-net none)
+  if [ -n "${FW_QEMU_ARGS+set}" ]; then
+    extra=("${FW_QEMU_ARGS[@]}")
+  fi
   cp "$OVMF_VARS" "$work/vars.fd"
   rm -f "$work/keys" "$work/serial.log"
   : >"$work/serial.log"
@@ -87,7 +115,7 @@ fw_boot() {
     -nographic -monitor none \
     -chardev stdio,id=console,signal=off,logfile="$work/serial.log" \
     -serial chardev:console \
-    -net none -no-reboot \
+    "${extra[@]}" -no-reboot \
     <"$work/keys" >"$work/qemu.out" 2>&1 &
   qemu_pid=$!
   while kill -0 "$qemu_pid" 2>/dev/null; do

@@ -1,0 +1,5 @@
+/* Included by the OpenSSL sources built into the image, which use nothing
+ * from it: the image has no C library. */
+#ifndef NW_OPENSSL_SHIM_SYS_TYPES_H
+#define NW_OPENSSL_SHIM_SYS_TYPES_H
+#endif

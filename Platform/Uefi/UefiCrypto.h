@@ -1,0 +1,8 @@
+// What the firmware image's crypto offers beyond the platform facade.
+#pragma once
+
+#include <stdint.h>
+
+// MD5 of Length bytes (OpenSSL's, as compiled into the image). HMAC-MD5 is
+// built on it; the firmware self-test checks it on its own.
+bool UefiMd5Digest(const void *Data, uint64_t Length, uint8_t Digest[16]);

@@ -1,0 +1,284 @@
+// Firmware self-test of the image's crypto and random bytes, run inside
+// OVMF by run-crypto-test.sh. It links the platform code exactly as
+// CIFSDrv.efi does and checks every primitive against published vectors:
+// MD4 (RFC 1320), MD5 (RFC 1321), HMAC-MD5 (RFC 2202) and RC4, each also fed
+// in uneven pieces and at length, since the digest code has been seen to go
+// wrong only under firmware interrupts. Then it reports which random source
+// answered ("@@RANDOM <source>"); the script knows which one QEMU offers.
+#include "FirmwareTestConsole.h"
+#include "NwPlatform.h"
+#include "UefiCrypto.h"
+#include "UefiRandom.h"
+
+namespace {
+
+struct DigestVector {
+  const char *Message;
+  const char *Md4;
+  const char *Md5;
+};
+
+// The test suites of RFC 1320 and RFC 1321 (same messages).
+constexpr DigestVector kDigestVectors[] = {
+    {"", "31d6cfe0d16ae931b73c59d7e0c089c0", "d41d8cd98f00b204e9800998ecf8427e"},
+    {"a", "bde52cb31de33e46245e05fbdbd6fb24", "0cc175b9c0f1b6a831c399e269772661"},
+    {"abc", "a448017aaf21d8525fc10ae87aa6729d", "900150983cd24fb0d6963f7d28e17f72"},
+    {"message digest", "d9130a8164549fe818874806e1c7014b", "f96b697d7cb7938d525a2f31aaf161d0"},
+    {"abcdefghijklmnopqrstuvwxyz", "d79e1c308aa5bbcdeea8ed63df412da9",
+     "c3fcd3d76192e4007dfb496cca67e13b"},
+    {"ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789",
+     "043f8582f241db351ce627e153e7f0e4", "d174ab98d277d9f5a5611c2c9f419d9f"},
+    {"1234567890123456789012345678901234567890123456789012345678901234567890123456789"
+     "0",
+     "e33b4ddc9c38f2199c3e7b164fcc0536", "57edf4a22be3c955ac49da2e2107b67a"},
+};
+
+// One million 'a', the long message of the classic digest test sets.
+constexpr UINT64 kMillion = 1000000;
+constexpr const char *kMillionAMd4 = "bbce80cc6bb65e5c6745e30d4eeca9a4";
+constexpr const char *kMillionAMd5 = "7707d6ae4e027c70eea2a935c2296f21";
+
+struct HmacVector {
+  UINT8 KeyByte; // the key is KeyLength copies of KeyByte, or 1..KeyLength when 0
+  UINT8 KeyLength;
+  const char *KeyText; // instead of the bytes, when set
+  UINT8 DataByte;      // the data is DataLength copies of DataByte
+  UINT8 DataLength;
+  const char *DataText; // instead of the bytes, when set
+  const char *Mac;
+};
+
+// RFC 2202, test cases 1 to 7 for HMAC-MD5.
+constexpr HmacVector kHmacVectors[] = {
+    {0x0b, 16, nullptr, 0, 0, "Hi There", "9294727a3638bb1c13f48ef8158bfc9d"},
+    {0, 0, "Jefe", 0, 0, "what do ya want for nothing?", "750c783e6ab0b503eaa86e310a5db738"},
+    {0xaa, 16, nullptr, 0xdd, 50, nullptr, "56be34521d144c88dbb8c733f0e8b3f6"},
+    {0, 25, nullptr, 0xcd, 50, nullptr, "697eaf0aca3a3aea3a75164746ffaa79"},
+    {0x0c, 16, nullptr, 0, 0, "Test With Truncation", "56461ef2342edc00f9bab995690efd4c"},
+    {0xaa, 80, nullptr, 0, 0, "Test Using Larger Than Block-Size Key - Hash Key First",
+     "6b1ab7fe4bd7bf8f0b62e6ce61b9d0cd"},
+    {0xaa, 80, nullptr, 0, 0,
+     "Test Using Larger Than Block-Size Key and Larger Than One Block-Size Data",
+     "6f630fad67cda0ee1fb1f562db3aa53e"},
+};
+
+struct Rc4Vector {
+  const char *Key;
+  const char *Plaintext;
+  const char *Ciphertext;
+};
+
+constexpr Rc4Vector kRc4Vectors[] = {
+    {"Key", "Plaintext", "bbf316e8d940af0ad3"},
+    {"Wiki", "pedia", "1021bf0420"},
+    {"Secret", "Attack at dawn", "45a01f645fc35b383552544b9bf5"},
+};
+// RFC 6229: the first 16 key-stream bytes for the 40-bit key 0102030405.
+constexpr UINT8 kRc4StreamKey[] = {1, 2, 3, 4, 5};
+constexpr const char *kRc4Stream = "b2396305f03dc027ccc3524a0a1118a8";
+
+const UINT8 *Bytes(const char *Text) {
+  return reinterpret_cast<const UINT8 *>(Text);
+}
+
+bool HexIs(const UINT8 *Digest, UINTN Length, const char *Expected) {
+  return AsciiStrCmp(FwTestHex(Digest, Length), Expected) == 0;
+}
+
+// MD4 of Length bytes, fed in pieces of at most Piece bytes.
+bool Md4Pieces(const UINT8 *Data, UINT64 Length, UINT64 Piece, UINT8 Digest[16]) {
+  NwMd4Context Ctx;
+  if (!NwMd4Init(&Ctx)) {
+    return false;
+  }
+  for (UINT64 Done = 0; Done < Length;) {
+    UINT64 Take = Length - Done < Piece ? Length - Done : Piece;
+    if (!NwMd4Update(&Ctx, Data + Done, Take)) {
+      return false;
+    }
+    Done += Take;
+  }
+  return NwMd4Final(&Ctx, Digest);
+}
+
+void CheckDigestVectors() {
+  for (const DigestVector &V : kDigestVectors) {
+    const UINT64 Length = AsciiStrLen(V.Message);
+    UINT8 Digest[16] = {};
+    bool Ok = Md4Pieces(Bytes(V.Message), Length, Length + 1, Digest);
+    FwTestCheck(Ok && HexIs(Digest, 16, V.Md4), "MD4 (\"%a\") = %a", V.Message,
+                FwTestHex(Digest, 16));
+    // Byte by byte, and in pieces of 7 across the block boundaries.
+    UINT8 ByteWise[16] = {};
+    UINT8 Sevens[16] = {};
+    Ok = Md4Pieces(Bytes(V.Message), Length, 1, ByteWise) &&
+         Md4Pieces(Bytes(V.Message), Length, 7, Sevens);
+    FwTestCheck(Ok && HexIs(ByteWise, 16, V.Md4) && HexIs(Sevens, 16, V.Md4),
+                "MD4 (\"%a\") fed in pieces", V.Message);
+    Ok = UefiMd5Digest(V.Message, Length, Digest);
+    FwTestCheck(Ok && HexIs(Digest, 16, V.Md5), "MD5 (\"%a\") = %a", V.Message,
+                FwTestHex(Digest, 16));
+  }
+}
+
+// A million 'a' in pieces whose sizes keep changing, so that every offset
+// within a block is a piece boundary at some point.
+void CheckMillion() {
+  constexpr UINT64 kChunk = 1031;
+  UINT8 *A = static_cast<UINT8 *>(AllocatePool(kChunk));
+  if (!FwTestCheck(A != nullptr, "buffer for the million-byte message")) {
+    return;
+  }
+  SetMem(A, kChunk, 'a');
+  NwMd4Context Md4;
+  bool Ok = NwMd4Init(&Md4);
+  UINT64 Done = 0;
+  for (UINT64 Piece = 1; Ok && Done < kMillion; Piece = (Piece * 5 + 13) % kChunk + 1) {
+    UINT64 Take = kMillion - Done < Piece ? kMillion - Done : Piece;
+    Ok = NwMd4Update(&Md4, A, Take);
+    Done += Take;
+  }
+  UINT8 Digest[16] = {};
+  Ok = Ok && NwMd4Final(&Md4, Digest);
+  FwTestCheck(Ok && HexIs(Digest, 16, kMillionAMd4), "MD4 of a million 'a' = %a",
+              FwTestHex(Digest, 16));
+  // MD5 over the same message in one piece.
+  UINT8 *Big = static_cast<UINT8 *>(AllocatePool(kMillion));
+  if (Big != nullptr) {
+    SetMem(Big, kMillion, 'a');
+    Ok = UefiMd5Digest(Big, kMillion, Digest);
+    FwTestCheck(Ok && HexIs(Digest, 16, kMillionAMd5), "MD5 of a million 'a' = %a",
+                FwTestHex(Digest, 16));
+    FreePool(Big);
+  } else {
+    FwTestCheck(false, "buffer for MD5 of a million 'a'");
+  }
+  FreePool(A);
+}
+
+void CheckHmacVectors() {
+  UINT32 Case = 1;
+  for (const HmacVector &V : kHmacVectors) {
+    UINT8 Key[80];
+    UINT8 Data[50];
+    const UINT8 *KeyBytes = Key;
+    UINTN KeyLength = V.KeyLength;
+    if (V.KeyText != nullptr) {
+      KeyBytes = Bytes(V.KeyText);
+      KeyLength = AsciiStrLen(V.KeyText);
+    } else {
+      for (UINTN I = 0; I < KeyLength; I++) {
+        Key[I] = V.KeyByte != 0 ? V.KeyByte : static_cast<UINT8>(I + 1);
+      }
+    }
+    const UINT8 *DataBytes = Data;
+    UINTN DataLength = V.DataLength;
+    if (V.DataText != nullptr) {
+      DataBytes = Bytes(V.DataText);
+      DataLength = AsciiStrLen(V.DataText);
+    } else {
+      SetMem(Data, DataLength, V.DataByte);
+    }
+    // Whole, then in two uneven updates.
+    NwHmacMd5Context Ctx;
+    UINT8 Mac[16] = {};
+    bool Ok = NwHmacMd5Init(&Ctx, KeyBytes, KeyLength) &&
+              NwHmacMd5Update(&Ctx, DataBytes, DataLength) && NwHmacMd5Final(&Ctx, Mac);
+    FwTestCheck(Ok && HexIs(Mac, 16, V.Mac), "HMAC-MD5 RFC 2202 case %u = %a", Case,
+                FwTestHex(Mac, 16));
+    UINT8 Split[16] = {};
+    Ok = NwHmacMd5Init(&Ctx, KeyBytes, KeyLength) && NwHmacMd5Update(&Ctx, DataBytes, 3) &&
+         NwHmacMd5Update(&Ctx, DataBytes + 3, DataLength - 3) && NwHmacMd5Final(&Ctx, Split);
+    FwTestCheck(Ok && HexIs(Split, 16, V.Mac), "HMAC-MD5 RFC 2202 case %u in two updates", Case);
+    Case++;
+  }
+}
+
+void CheckRc4() {
+  for (const Rc4Vector &V : kRc4Vectors) {
+    const UINTN Length = AsciiStrLen(V.Plaintext);
+    UINT8 Out[32] = {};
+    NwArc4Context Ctx;
+    bool Ok = NwArc4Init(&Ctx, Bytes(V.Key), AsciiStrLen(V.Key)) &&
+              NwArc4Encrypt(&Ctx, Bytes(V.Plaintext), Length, Out);
+    FwTestCheck(Ok && HexIs(Out, Length, V.Ciphertext), "RC4 key \"%a\" on \"%a\" = %a", V.Key,
+                V.Plaintext, FwTestHex(Out, Length));
+  }
+  // The key stream continues across calls: 5 + 11 bytes equal 16 at once.
+  UINT8 Zeros[16] = {};
+  UINT8 Stream[16] = {};
+  NwArc4Context Ctx;
+  bool Ok = NwArc4Init(&Ctx, kRc4StreamKey, sizeof(kRc4StreamKey)) &&
+            NwArc4Encrypt(&Ctx, Zeros, 5, Stream) && NwArc4Encrypt(&Ctx, Zeros + 5, 11, Stream + 5);
+  FwTestCheck(Ok && HexIs(Stream, 16, kRc4Stream), "RC4 key stream (RFC 6229, 40-bit key) = %a",
+              FwTestHex(Stream, 16));
+  // Decryption is the same operation.
+  UINT8 Back[16] = {};
+  Ok = NwArc4Init(&Ctx, kRc4StreamKey, sizeof(kRc4StreamKey)) &&
+       NwArc4Encrypt(&Ctx, Stream, 16, Back);
+  FwTestCheck(Ok && CompareMem(Back, Zeros, 16) == 0, "RC4 twice gives the plaintext back");
+}
+
+void CheckRefusals() {
+  NwArc4Context Arc4;
+  UINT8 Key[257] = {};
+  FwTestCheck(!NwArc4Init(&Arc4, Key, 0), "RC4 refuses an empty key");
+  FwTestCheck(!NwArc4Init(&Arc4, Key, sizeof(Key)), "RC4 refuses a key over 256 bytes");
+  FwTestCheck(NwArc4Init(&Arc4, Key, 256), "RC4 takes a 256-byte key");
+  NwMd4Context Md4;
+  FwTestCheck(!NwMd4Init(nullptr) && NwMd4Init(&Md4) && !NwMd4Update(&Md4, nullptr, 1) &&
+                  !NwMd4Final(&Md4, nullptr),
+              "MD4 refuses missing context, data and digest");
+  NwHmacMd5Context Hmac;
+  FwTestCheck(!NwHmacMd5Init(&Hmac, nullptr, 16) && !NwHmacMd5Init(nullptr, Key, 16),
+              "HMAC-MD5 refuses a missing key or context");
+  UINT8 Digest[16];
+  FwTestCheck(!UefiMd5Digest(nullptr, 1, Digest), "MD5 refuses missing data");
+}
+
+const char *SourceName(UefiRandomSource Source) {
+  switch (Source) {
+  case UefiRandomSource::RngProtocol:
+    return "rng-protocol";
+  case UefiRandomSource::Rdrand:
+    return "rdrand";
+  case UefiRandomSource::None:
+    break;
+  }
+  return "none";
+}
+
+void CheckRandom() {
+  UINT8 First[37] = {};
+  UINT8 Second[37] = {};
+  const UefiRandomSource Source = UefiFillRandom(First, sizeof(First));
+  FwTestPrint("@@RANDOM %a\n", SourceName(Source));
+  const bool Facade = NwRandomBytes(Second, sizeof(Second));
+  if (Source == UefiRandomSource::None) {
+    FwTestCheck(!Facade, "without a random source NwRandomBytes fails");
+    return;
+  }
+  FwTestCheck(Facade, "NwRandomBytes succeeds");
+  // 37 bytes: not a whole number of 64-bit words. Two draws that agree, or
+  // a draw with a zero tail, would mean the bytes were not all filled.
+  UINT8 Zeros[8] = {};
+  FwTestCheck(CompareMem(First, Second, sizeof(First)) != 0, "two random draws differ");
+  FwTestCheck(CompareMem(First + 29, Zeros, 8) != 0 || CompareMem(Second + 29, Zeros, 8) != 0,
+              "the last bytes of a draw are filled");
+}
+
+} // namespace
+
+extern "C" EFI_STATUS EFIAPI EfiMain(EFI_HANDLE ImageHandle, EFI_SYSTEM_TABLE *SystemTable) {
+  FwTestStart(ImageHandle, SystemTable);
+  FwTestPrint("@@BEGIN crypto-check\n");
+  CheckDigestVectors();
+  CheckMillion();
+  CheckHmacVectors();
+  CheckRc4();
+  CheckRefusals();
+  CheckRandom();
+  EFI_STATUS Status = FwTestFinish();
+  FwTestPrint("@@END crypto-check\n");
+  return Status;
+}
