@@ -1,0 +1,24 @@
+// The TCP transport under the SMB2 client: address parsing, socket creation
+// and connect, and moving message bytes. Results are socket-style integers
+// (0 success, -1 or a BSD errno value on failure), not EFI_STATUS.
+#pragma once
+
+#include "NwPlatform.h"
+#include "Uefi.h"
+
+constexpr UINT16 SMB2_SERVER_PORT = 445;
+// Every SMB2 response reader passes this loop limit to the read-all call.
+constexpr UINT8 TCP_RX_LOOP_LIMIT = 5;
+
+INT32 TCP_GetDomainTypeByIPAddress(const CHAR8 *IpAddress, INT32 *Domain, UINT16 Port,
+                                   NwSockAddrIn *SocketAddr, NwSockAddrIn6 *SocketAddr6);
+INT32 TCP_CreateSocket(INT32 *SockFd, INT32 Domain);
+INT32 TCP_Connect(INT32 SockFd, UINT8 SetOption, INT32 OptionLevel, INT32 OptionName,
+                  INT32 OptionValue, const void *SocketAddr, UINT32 AddrLength);
+INT32 TCP_SendMessage(INT32 SockFd, const void *Buffer, INT64 Size, INT64 *SentBytes);
+INT32 TCP_PollAndSendMessage(INT32 SockFd, const void *Buffer, INT64 Size, INT64 *SentBytes);
+INT32 TCP_ReceiveMessage(INT32 SockFd, void *Buffer, INT64 Size, INT64 *ReceivedBytes);
+INT32 TCP_PollAndReceiveMessage(INT32 SockFd, void *Buffer, INT64 Size, INT64 *ReceivedBytes);
+INT32 TCP_PollAndTryToRxAllData(INT32 SockFd, void *Buffer, INT64 Size, UINT8 LoopCount,
+                                INT64 *TotalRead);
+INT32 TCP_CloseSocket(INT32 SockFd);

@@ -1,0 +1,496 @@
+// SMB2_Connect and SMB2_Disconnect against the scripted server: the bytes
+// the client sends, and how it copes with a server that answers wrongly,
+// partially, too much, or not at all. Every test ends with no pool block
+// and no socket left behind.
+#include "MockSmbServer.h"
+#include "Smb2TestEnv.h"
+#include "smb2/SMB2Connect.h"
+
+#include <algorithm>
+#include <random>
+#include <string>
+#include <vector>
+
+using namespace MockSmb;
+
+namespace {
+
+constexpr uint32_t kMoreProcessing = 0xC0000016;
+
+uint16_t Command(const Bytes &Request) {
+  return GetLe16(Request, 16);
+}
+uint64_t MessageId(const Bytes &Request) {
+  return GetLe64(Request, 28);
+}
+uint32_t TreeOf(const Bytes &Request) {
+  return GetLe32(Request, 40);
+}
+uint64_t SessionOf(const Bytes &Request) {
+  return GetLe64(Request, 44);
+}
+uint16_t CreditCharge(const Bytes &Request) {
+  return GetLe16(Request, 10);
+}
+
+Bytes ChallengeReply(const ChallengeShape &Shape = ChallengeShape()) {
+  return SessionSetupResponse(kMoreProcessing, 1, kSessionId, Challenge(Shape));
+}
+Bytes AuthReply(uint32_t Status = 0) {
+  return SessionSetupResponse(Status, 2, kSessionId, {});
+}
+Bytes TreeReply() {
+  return TreeConnectResponse(3, kSessionId, kTreeId);
+}
+
+class Smb2ConnectMockTest : public Smb2ConnectTest {
+protected:
+  void SetUp() override {
+    Smb2ConnectTest::SetUp();
+    Use("127.0.0.1", "share", "CIFSTEST");
+  }
+
+  // Starts the scripted server and connects to it.
+  EFI_STATUS Connect(Server &S, std::string *Out = nullptr) {
+    HostSetConnectPortOverride(S.Port());
+    S.Start();
+    return Smb2ConnectTest::Connect(Out);
+  }
+};
+
+TEST_F(Smb2ConnectMockTest, ConnectAndDisconnectOnDialect210) {
+  Server S;
+  S.ScriptConnect(0x0210).ScriptDisconnect();
+  ASSERT_EQ(Connect(S), EFI_SUCCESS);
+  EXPECT_EQ(Info.Connected, 1);
+  EXPECT_EQ(+TransactDetails.DialectRevision, 0x0210);
+  EXPECT_EQ(+TransactDetails.SessionId, kSessionId);
+  EXPECT_EQ(+TransactDetails.TreeId, kTreeId);
+  EXPECT_EQ(+TransactDetails.MessageId, 3u);
+  EXPECT_EQ(+TransactDetails.ServerCapabilities, 6u);
+  EXPECT_STREQ(TransactDetails.ShareDetails.FormattedAddress, "127.0.0.1");
+  EXPECT_EQ(SMB2ConnectionState, SMB2_STATE_TREE);
+  EXPECT_EQ(Share.MaxReadSize, 0x800000u);
+  EXPECT_EQ(Share.MaxWriteSize, 0x800000u);
+  EXPECT_EQ(Share.MaxTransactSize, 0x800000u);
+  EXPECT_EQ(Share.LastStatus, 0u);
+
+  ASSERT_EQ(Disconnect(), EFI_SUCCESS);
+  EXPECT_EQ(gSMB2SockFd, 0);
+  EXPECT_EQ(SMB2ConnectionState, SMB2_STATE_CLOSED);
+  S.Join();
+  ASSERT_EQ(S.Failure(), "");
+
+  std::vector<Bytes> R = S.Requests();
+  ASSERT_EQ(R.size(), 6u);
+  // NEGOTIATE: 108 bytes, two dialects, the fixed client GUID.
+  EXPECT_EQ(Hex(R[0].data(), R[0].size()), "00000068"
+                                           "fe534d42"
+                                           "4000"
+                                           "0000"
+                                           "00000000"
+                                           "0000"
+                                           "0200" +
+                                               std::string(96, '0') +
+                                               "2400"
+                                               "0200"
+                                               "0100"
+                                               "0000"
+                                               "00000000"
+                                               "29a6b1fc77f13847a67737a3cb048eba"
+                                               "0000000000000000"
+                                               "0202"
+                                               "1002");
+  // SESSION_SETUP legs: ids 1 and 2, the session id only on the second,
+  // the raw NTLMSSP token at 88.
+  for (int Leg = 1; Leg <= 2; Leg++) {
+    const Bytes &Q = R[Leg];
+    EXPECT_EQ(Command(Q), 1);
+    EXPECT_EQ(MessageId(Q), uint64_t(Leg));
+    EXPECT_EQ(SessionOf(Q), Leg == 1 ? 0 : kSessionId);
+    EXPECT_EQ(TreeOf(Q), 0u);
+    EXPECT_EQ(GetLe16(Q, 68), 25);
+    EXPECT_EQ(Q[71], 1) << "security mode adopted from the server";
+    EXPECT_EQ(GetLe16(Q, 80), 88);
+    EXPECT_EQ(GetLe16(Q, 82) + 92u, Q.size());
+    EXPECT_EQ(StreamLength(Q), Q.size() - 4);
+    EXPECT_EQ(Hex(Q.data() + 92, 9), Leg == 1 ? "4e544c4d5353500001" : "4e544c4d5353500003");
+  }
+  EXPECT_EQ(GetLe16(R[1], 82), 32);
+  // TREE_CONNECT: id 3, credit charge 1, the UNC path in UTF-16 and two
+  // zero bytes that PathLength does not count.
+  const Bytes &T = R[3];
+  EXPECT_EQ(Command(T), 3);
+  EXPECT_EQ(MessageId(T), 3u);
+  EXPECT_EQ(CreditCharge(T), 1);
+  EXPECT_EQ(TreeOf(T), 0u);
+  EXPECT_EQ(SessionOf(T), kSessionId);
+  EXPECT_EQ(GetLe16(T, 68), 9);
+  EXPECT_EQ(GetLe16(T, 72), 72);
+  Bytes Unc = Utf16(Path);
+  EXPECT_EQ(GetLe16(T, 74), Unc.size());
+  EXPECT_EQ(T.size(), Unc.size() + 78);
+  EXPECT_EQ(Bytes(T.begin() + 76, T.end()), Concat({Unc, Bytes{0, 0}}));
+  // TREE_DISCONNECT (4) and LOGOFF (2): 72 bytes with tree and session ids.
+  EXPECT_EQ(Command(R[4]), 4);
+  EXPECT_EQ(Command(R[5]), 2);
+  for (int I = 4; I <= 5; I++) {
+    EXPECT_EQ(R[I].size(), 72u);
+    EXPECT_EQ(MessageId(R[I]), uint64_t(I));
+    EXPECT_EQ(TreeOf(R[I]), kTreeId);
+    EXPECT_EQ(SessionOf(R[I]), kSessionId);
+    EXPECT_EQ(GetLe16(R[I], 68), 4);
+    EXPECT_EQ(CreditCharge(R[I]), 0);
+  }
+}
+
+// On 2.0.2 nothing is charged; the server's grant and security mode are
+// adopted (3 = signing required is accepted; the client never signs).
+TEST_F(Smb2ConnectMockTest, Dialect202OverIPv6) {
+  Server S(Server::Family::V6);
+  Use("::1", "share", "CIFSTEST");
+  S.ExpectRequest().Send(NegotiateResponse(0x0202, 3, 0, 0x10000, 1));
+  S.ExpectRequest().Send(ChallengeReply()).ExpectRequest().Send(AuthReply());
+  S.ExpectRequest().Send(TreeReply()).ScriptDisconnect();
+  ASSERT_EQ(Connect(S), EFI_SUCCESS);
+  EXPECT_EQ(+TransactDetails.DialectRevision, 0x0202);
+  EXPECT_EQ(+TransactDetails.CreditRequest, 1);
+  EXPECT_EQ(+TransactDetails.SecurityMode, 3);
+  EXPECT_EQ(Share.MaxReadSize, 0x10000u);
+  ASSERT_EQ(Disconnect(), EFI_SUCCESS);
+  S.Join();
+  std::vector<Bytes> R = S.Requests();
+  ASSERT_EQ(R.size(), 6u);
+  EXPECT_EQ(R[1][71], 3);
+  EXPECT_EQ(CreditCharge(R[3]), 0);
+}
+
+TEST_F(Smb2ConnectMockTest, RefusedDialects) {
+  struct Case {
+    uint16_t Dialect;
+    EFI_STATUS Expected;
+    const char *Message;
+  } Cases[] = {
+      {0x0300, EFI_UNSUPPORTED, "Unsupported dialect 0x300 detected! \n"},
+      {0x02FF, EFI_UNSUPPORTED,
+       "Wildcard dialect 0x2ff detected! It is unsupported at the moment!\n"},
+      {0x0201, EFI_NOT_FOUND, "Unrecognized dialect 0x201 detected! \n"},
+  };
+  for (const Case &C : Cases) {
+    Server S;
+    S.ExpectRequest().Send(NegotiateResponse(C.Dialect)).DrainUntilClosed();
+    std::string Out;
+    EXPECT_EQ(Connect(S, &Out), C.Expected) << std::hex << C.Dialect;
+    EXPECT_TRUE(Contains(Out, C.Message)) << Out;
+    EXPECT_TRUE(Contains(Out, "SMB2Negotiate failed!"));
+    EXPECT_EQ(Info.Connected, 0);
+    // The socket stays open for the disconnect, which still logs off.
+    EXPECT_NE(gSMB2SockFd, 0);
+    Disconnect();
+    S.Join();
+    ASSERT_EQ(S.Requests().size(), 2u);
+    EXPECT_EQ(Command(S.Requests()[1]), 2);
+  }
+}
+
+TEST_F(Smb2ConnectMockTest, ContinuationStatusPassesWithAWrongProtocolId) {
+  Server S;
+  Bytes Bent = ChallengeReply();
+  Bent[4] = 0xFF; // 0xFE 'S' 'M' 'B' → 0xFF 'S' 'M' 'B'
+  S.ExpectRequest().Send(NegotiateResponse(0x0210));
+  S.ExpectRequest().Send(Bent).ExpectRequest().Send(AuthReply());
+  S.ExpectRequest().Send(TreeReply()).ScriptDisconnect();
+  std::string Out;
+  ASSERT_EQ(Connect(S, &Out), EFI_SUCCESS);
+  EXPECT_TRUE(Contains(Out, "Header check failed!"));
+  ASSERT_EQ(Disconnect(), EFI_SUCCESS);
+}
+
+TEST_F(Smb2ConnectMockTest, MessageIdOffByOneIsRefused) {
+  Server S;
+  S.ExpectRequest().Send(NegotiateResponse(0x0210));
+  S.ExpectRequest().Send(ChallengeReply()).ExpectRequest().Send(AuthReply());
+  S.ExpectRequest().Send(TreeConnectResponse(2, kSessionId, kTreeId)).DrainUntilClosed();
+  std::string Out;
+  EXPECT_EQ(Connect(S, &Out), EFI_DEVICE_ERROR);
+  EXPECT_TRUE(Contains(Out, "Response Message Id is incorrect! Id = 0x2, Expected = 0x3\n"));
+  EXPECT_TRUE(
+      Contains(Out, "SMB2TreeConnectResponse returned unsuccessful! Status = 0xc0000001\n"));
+  EXPECT_TRUE(Contains(Out, "SMB2TreeConnect returned unsuccessful! Status = 0xc0000001\n"));
+  EXPECT_TRUE(Contains(Out, "BufPtr[67] = 0x0\n"));
+  EXPECT_EQ(SMB2ConnectionState, SMB2_STATE_SESSION);
+}
+
+// A refused response is consumed whole, so the teardown that follows still
+// speaks on message boundaries: the logoff is answered and accepted.
+TEST_F(Smb2ConnectMockTest, ErrorStatusIsRecordedAndTheStreamStaysInStep) {
+  Server S;
+  S.ExpectRequest().Send(NegotiateResponse(0x0210));
+  S.ExpectRequest().Send(ChallengeReply()).ExpectRequest().Send(AuthReply());
+  S.ExpectRequest().Send(ErrorResponse(3, 0xC0000022, 3, kSessionId));
+  S.ExpectRequest().Send(SimpleResponse(2, 4, kSessionId, 0));
+  std::string Out;
+  EXPECT_EQ(Connect(S, &Out), EFI_DEVICE_ERROR);
+  EXPECT_TRUE(
+      Contains(Out, "SMB2VerifyHeader: Response Status returned error! Status = 0xc0000022\n"));
+  EXPECT_EQ(+TransactDetails.ResponseStatus, 0xC0000022u);
+  EXPECT_EQ(Share.LastStatus, 0xC0000022u);
+  EXPECT_EQ(Disconnect(&Out), EFI_SUCCESS) << Out;
+  EXPECT_EQ(Share.LastStatus, 0u);
+  S.Join();
+  EXPECT_EQ(S.Failure(), "");
+}
+
+TEST_F(Smb2ConnectMockTest, RefusedNegotiateIsConsumedWhole) {
+  Server S;
+  S.ExpectRequest().Send(ErrorResponse(0, 0xC0000022, 0));
+  S.ExpectRequest().Send(SimpleResponse(2, 1, 0, 0));
+  std::string Out;
+  EXPECT_EQ(Connect(S, &Out), EFI_PROTOCOL_ERROR);
+  EXPECT_TRUE(
+      Contains(Out, "SMB2NegotiateResponse failed! 0xc0000001 (-1073741823), TCP status = 0"))
+      << Out;
+  EXPECT_EQ(Disconnect(&Out), EFI_SUCCESS) << Out;
+}
+
+TEST_F(Smb2ConnectMockTest, ShortHeaderDrainsOnlyWhenTheLengthArrived) {
+  for (size_t Cut : {size_t(10), size_t(3)}) {
+    Server S;
+    Bytes Tree = TreeReply();
+    S.ExpectRequest().Send(NegotiateResponse(0x0210));
+    S.ExpectRequest().Send(ChallengeReply()).ExpectRequest().Send(AuthReply());
+    S.ExpectRequest().Send(Bytes(Tree.begin(), Tree.begin() + Cut)).Close();
+    std::string Out;
+    EXPECT_EQ(Connect(S, &Out), EFI_DEVICE_ERROR);
+    size_t Reports = 0;
+    for (size_t At = Out.find("Error in receiving the data!"); At != std::string::npos;
+         At = Out.find("Error in receiving the data!", At + 1)) {
+      Reports++;
+    }
+    // With the stream length in hand the rest is drained (and reported
+    // again); with 3 bytes there is nothing to go by.
+    EXPECT_EQ(Reports, Cut == 10 ? 2u : 1u) << Out;
+    EXPECT_TRUE(Contains(Out, "SMB2ReadVerifyHeader failed!"));
+    EXPECT_TRUE(
+        Contains(Out, "SMB2TreeConnectResponse returned unsuccessful! Status = 0xc0000001"));
+    Disconnect();
+  }
+}
+
+TEST_F(Smb2ConnectMockTest, ConnectionResetIsReported) {
+  Server S;
+  S.ExpectRequest().Pause(50).Reset();
+  std::string Out;
+  EXPECT_EQ(Connect(S, &Out), EFI_PROTOCOL_ERROR);
+  EXPECT_TRUE(Contains(Out, "Server has reset the connection!\n")) << Out;
+  EXPECT_TRUE(Contains(Out, "TCP status = 54\n")) << Out;
+  EXPECT_EQ(+TransactDetails.TransportStatus, 54u);
+}
+
+TEST_F(Smb2ConnectMockTest, SilentServerEndsWithATimeOut) {
+  HostSetSocketTimeoutMs(300);
+  Server S;
+  S.ExpectRequest().Pause(600).Close();
+  std::string Out;
+  EXPECT_EQ(Connect(S, &Out), EFI_PROTOCOL_ERROR);
+  EXPECT_TRUE(Contains(Out, "errno = 60 (Operation timed out)")) << Out;
+}
+
+TEST_F(Smb2ConnectMockTest, ResponsesArrivingInPiecesAreReassembled) {
+  Server S;
+  Bytes Tree = TreeReply();
+  S.ExpectRequest().SendInPieces(NegotiateResponse(0x0210), {2, 50, 100}, 20);
+  S.ExpectRequest().SendInPieces(ChallengeReply(), {70, 80}, 20);
+  S.ExpectRequest().Send(AuthReply());
+  S.ExpectRequest().SendInPieces(Tree, {30, 60}, 20).ScriptDisconnect();
+  ASSERT_EQ(Connect(S), EFI_SUCCESS);
+  ASSERT_EQ(Disconnect(), EFI_SUCCESS);
+}
+
+TEST_F(Smb2ConnectMockTest, ChallengeWithoutTargetInfo) {
+  Server S;
+  ChallengeShape Shape;
+  Shape.Flags &= ~0x00800000u;
+  S.ExpectRequest().Send(NegotiateResponse(0x0210));
+  S.ExpectRequest().Send(ChallengeReply(Shape)).DrainUntilClosed();
+  std::string Out;
+  EXPECT_EQ(Connect(S, &Out), EFI_DEVICE_ERROR);
+  EXPECT_TRUE(Contains(Out, "TargetInfo.MaximumLength is zero length!\n"));
+  EXPECT_TRUE(Contains(Out, "SMB2SessionChallengeResponse returned error! Status = 0xc0000004\n"));
+  EXPECT_TRUE(Contains(Out, "SMB2SessionSetup failed!"));
+
+  // A disconnect after a failed session setup skips the tree disconnect.
+  EXPECT_EQ(SMB2ConnectionState, SMB2_STATE_CLOSED);
+  Disconnect();
+  S.Join();
+  ASSERT_EQ(S.Requests().size(), 3u);
+  EXPECT_EQ(Command(S.Requests()[2]), 2);
+  EXPECT_EQ(MessageId(S.Requests()[2]), 2u);
+}
+
+TEST_F(Smb2ConnectMockTest, HostileChallengesFailCleanly) {
+  Use("127.0.0.1", "share", nullptr);
+  std::vector<ChallengeShape> Shapes(5);
+  // AV pairs that run past the end of the target info.
+  Shapes[0].TargetInfo = Concat({AvPair(1, Utf16("S")), AvPair(2, Utf16("DOMAIN"))});
+  Shapes[0].TargetInfo.resize(Shapes[0].TargetInfo.size() - 6);
+  // A target name of 255 bytes.
+  Shapes[1].TargetName = Bytes(255, 'N');
+  // Target info beyond the message; a wrong message type; a bad signature.
+  Shapes[2].InfoOffset = 0x7000;
+  Shapes[3].MessageType = 3;
+  Shapes[4].ServerChallenge = {};
+  const char *Messages[] = {"Breaking as end of blob!\n", "Target name length 255 is more than 255",
+                            "Target info lies outside",
+                            "Session Message type is incorrect! Type = 0x3", nullptr};
+  for (size_t I = 0; I < Shapes.size(); I++) {
+    Bytes Reply = ChallengeReply(Shapes[I]);
+    if (I == 4) {
+      Reply[4 + 72] = 'X'; // "XTLMSSP"
+    }
+    Server S;
+    S.ExpectRequest()
+        .Send(NegotiateResponse(0x0210))
+        .ExpectRequest()
+        .Send(Reply)
+        .DrainUntilClosed();
+    std::string Out;
+    EXPECT_EQ(Connect(S, &Out), EFI_DEVICE_ERROR) << I;
+    if (Messages[I] != nullptr) {
+      EXPECT_TRUE(Contains(Out, Messages[I])) << I << Out;
+    } else {
+      EXPECT_TRUE(Contains(Out, "Session Message type is incorrect! Signature = XTLMSSP")) << Out;
+    }
+    Disconnect();
+  }
+}
+
+// The first leg must ask for more processing; the second must succeed.
+TEST_F(Smb2ConnectMockTest, SessionSetupLegsWithTheWrongStatus) {
+  struct Case {
+    Bytes First, Second;
+    uint32_t Recorded;
+    const char *Message;
+  } Cases[] = {
+      {SessionSetupResponse(0, 1, kSessionId, Challenge(ChallengeShape())),
+       {},
+       0,
+       "Session Status is incorrect! Status = 0x0\n"},
+      {ChallengeReply(), AuthReply(0xC000006D), 0xC000006D,
+       "SMB2VerifyHeader: Response Status returned error! Status = 0xc000006d\n"},
+      {ChallengeReply(), AuthReply(kMoreProcessing), kMoreProcessing,
+       "Session Status is incorrect! Status = 0xc0000016\n"},
+  };
+  for (const Case &C : Cases) {
+    Server S;
+    S.ExpectRequest().Send(NegotiateResponse(0x0210)).ExpectRequest().Send(C.First);
+    if (!C.Second.empty()) {
+      S.ExpectRequest().Send(C.Second);
+    }
+    S.DrainUntilClosed();
+    std::string Out;
+    EXPECT_EQ(Connect(S, &Out), EFI_DEVICE_ERROR);
+    EXPECT_TRUE(Contains(Out, C.Message)) << Out;
+    EXPECT_EQ(+TransactDetails.ResponseStatus, C.Recorded);
+    if (!C.Second.empty()) {
+      EXPECT_TRUE(
+          Contains(Out, "SMB2SessionSetupResponse returned unsuccessful! Status = 0xc0000001\n"));
+    }
+    Disconnect();
+  }
+}
+
+TEST_F(Smb2ConnectMockTest, LengthsBeyondWhatArrivedAreRefused) {
+  // A negotiate announcing a huge body, then hanging up.
+  Bytes Huge = NegotiateResponse(0x0210);
+  Huge[1] = 0xFF;
+  // A negotiate body too short to hold its fields.
+  Bytes Full = NegotiateResponse(0x0210);
+  Bytes Short = Frame(Bytes(Full.begin() + 4, Full.begin() + 4 + 64 + 10));
+  // A security buffer pointing past the message, and one too small for a
+  // CHALLENGE.
+  Bytes Outside = ChallengeReply();
+  SetLe16(Outside, 4 + 68, 0x4000);
+  Bytes Tiny = SessionSetupResponse(kMoreProcessing, 1, kSessionId, Bytes(20, 'N'));
+  // A tree connect answer with a 4-byte body.
+  Bytes Stub = SimpleResponse(3, 3, kSessionId, kTreeId);
+  std::vector<std::vector<Bytes>> Scripts = {
+      {Huge},
+      {Short},
+      {NegotiateResponse(0x0210), Outside},
+      {NegotiateResponse(0x0210), Tiny},
+      {NegotiateResponse(0x0210), ChallengeReply(), AuthReply(), Stub}};
+  for (size_t I = 0; I < Scripts.size(); I++) {
+    Server S;
+    for (const Bytes &Reply : Scripts[I]) {
+      S.ExpectRequest().Send(Reply);
+    }
+    S.Close();
+    EXPECT_TRUE(EFI_ERROR(Connect(S))) << I;
+    Disconnect();
+  }
+}
+
+// Whatever a server sends, the client reads and writes only inside its
+// buffers (the sanitizers watch) and leaves nothing behind: each round
+// bends one answer of a connect (a flipped byte, a 16-bit field set to an
+// extreme, a cut) and hangs up right after it.
+TEST_F(Smb2ConnectMockTest, RandomlyBentAnswersAreSurvived) {
+  HostSetSocketTimeoutMs(1000);
+  std::mt19937 Random(20240611);
+  const Bytes Answers[] = {NegotiateResponse(0x0210), ChallengeReply(), AuthReply(), TreeReply()};
+  int Connected = 0;
+  for (int Round = 0; Round < 500; Round++) {
+    size_t Bent = Random() % 4;
+    Bytes Answer = Answers[Bent];
+    size_t At = Random() % Answer.size();
+    switch (Random() % 3) {
+    case 0:
+      Answer[At] ^= static_cast<uint8_t>(1 + Random() % 255);
+      break;
+    case 1:
+      At = std::min(At, Answer.size() - 2);
+      SetLe16(Answer, At, Random() % 2 ? 0xFFFF : static_cast<uint16_t>(Random()));
+      break;
+    default:
+      Answer.resize(At);
+      break;
+    }
+    Server S;
+    for (size_t I = 0; I < Bent; I++) {
+      S.ExpectRequest().Send(Answers[I]);
+    }
+    S.ExpectRequest().Send(Answer).Close();
+    Connected += Connect(S) == EFI_SUCCESS;
+    Disconnect();
+    ASSERT_EQ(gSMB2SockFd, 0) << Round;
+  }
+  // Some bends are harmless (a flipped server GUID byte); most are not.
+  EXPECT_GT(Connected, 0);
+  EXPECT_LT(Connected, 250);
+}
+
+TEST_F(Smb2ConnectMockTest, FailuresBeforeAnyExchange) {
+  uint16_t Port;
+  {
+    Server Gone; // bound but never started: closed once it goes
+    Port = Gone.Port();
+  }
+  HostSetConnectPortOverride(Port);
+  std::string Out = Console([&] { EXPECT_EQ(SMB2_Connect(&Info, &Share), EFI_DEVICE_ERROR); });
+  EXPECT_TRUE(Contains(Out, "connect failed! errno = 61 (Connection refused)")) << Out;
+  EXPECT_NE(gSMB2SockFd, 0) << "the socket is left for the disconnect to close";
+  Disconnect();
+
+  Use("server.example", "share", nullptr);
+  Out = Console([&] { EXPECT_EQ(SMB2_Connect(&Info, &Share), EFI_DEVICE_ERROR); });
+  EXPECT_TRUE(Contains(Out, "TCP_GetDomainTypeByIPAddress failed! Status = 0xffffffff (-1)"))
+      << Out;
+  EXPECT_EQ(gSMB2SockFd, 0);
+
+  EXPECT_EQ(Disconnect(&Out), EFI_NOT_FOUND);
+  EXPECT_TRUE(Contains(Out, "gSMB2SockFd is 0!\n"));
+  EXPECT_EQ(SMB2_Disconnect(nullptr, &Share), EFI_INVALID_PARAMETER);
+}
+
+} // namespace

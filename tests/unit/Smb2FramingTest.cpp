@@ -1,0 +1,239 @@
+// SMB2 framing and the transport underneath it: per-command header fields
+// and credit charges, the response-header check, the NT-code mapping, the
+// builders' and connect parameters' limits, address parsing, and the
+// read-all loop against a peer that stops sending.
+#include "MockSmbServer.h"
+#include "Smb2TestEnv.h"
+#include "smb2/SMB2Connect.h"
+#include "smb2/SMB2Session.h"
+#include "smb2/TcpTransport.h"
+
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <string>
+#include <thread>
+
+using MockSmb::Bytes;
+using MockSmb::Hex;
+
+namespace {
+
+class Smb2FramingTest : public Smb2HostTest {
+protected:
+  void TearDown() override {
+    ExpectNoPoolLeak();
+    Smb2HostTest::TearDown();
+  }
+};
+
+TEST_F(Smb2FramingTest, PerCommandHeaderFieldsAndCreditCharges) {
+  TransactDetails.MessageId = 9;
+  TransactDetails.SessionId = 0x1122334455667788ULL;
+  TransactDetails.TreeId = 7;
+  TransactDetails.DialectRevision = 0x0210;
+  const UINT64 Sid = 0x1122334455667788ULL;
+  struct Case {
+    UINT16 Command;
+    UINT64 MessageId;
+    UINT32 TreeId;
+    UINT64 SessionId;
+    UINT16 Charge;
+  } Cases[] = {{SMB2_NEGOTIATE, 0, 0, 0, 0},      {SMB2_SESSION_SETUP, 9, 0, Sid, 0},
+               {SMB2_TREE_CONNECT, 9, 0, Sid, 1}, {SMB2_TREE_DISCONNECT, 9, 7, Sid, 0},
+               {SMB2_LOGOFF, 9, 7, Sid, 0},       {SMB2_CREATE, 9, 7, Sid, 1}};
+  for (const Case &C : Cases) {
+    SMB2_HEADER Header;
+    memset(&Header, 0xCC, sizeof(Header));
+    ASSERT_EQ(SMB2HeaderConstruct(&Header), EFI_SUCCESS);
+    SMB2HeaderFill(&Header, C.Command, 100, &TransactDetails);
+    EXPECT_EQ(Hex(reinterpret_cast<UINT8 *>(&Header), 12),
+              "00000060fe534d4240000" + std::to_string(C.Charge) + "00");
+    EXPECT_EQ(+Header.MessageId, C.MessageId) << C.Command;
+    EXPECT_EQ(+Header.TreeId, C.TreeId) << C.Command;
+    EXPECT_EQ(+Header.SessionId, C.SessionId) << C.Command;
+    EXPECT_EQ(+Header.CreditRequest, 2);
+    EXPECT_EQ(+Header.Flags | Header.Status | Header.NextCommand, 0u);
+  }
+  // READ and WRITE: one credit per started 64 KiB, 32-bit arithmetic
+  // stored in 16 bits; nothing on dialect 0x0202.
+  EXPECT_EQ(SMB2CreditCharge(SMB2_READ, 65536, SMB2_DIALECT_210), 1);
+  EXPECT_EQ(SMB2CreditCharge(SMB2_READ, 65537, SMB2_DIALECT_210), 2);
+  EXPECT_EQ(SMB2CreditCharge(SMB2_WRITE, 64512, SMB2_DIALECT_210), 1);
+  EXPECT_EQ(SMB2CreditCharge(SMB2_WRITE, 0, SMB2_DIALECT_210), 0);
+  EXPECT_EQ(SMB2CreditCharge(SMB2_READ, 65537, SMB2_DIALECT_202), 0);
+  EXPECT_EQ(SMB2CreditCharge(SMB2_QUERY_INFO, 0, SMB2_DIALECT_202), 0);
+}
+
+TEST_F(Smb2FramingTest, HeaderCheck) {
+  TransactDetails.MessageId = 5;
+  auto Check = [](UINT32 Status, UINT64 MessageId, int BadProtocolByte, EFI_STATUS *Result) {
+    SMB2_HEADER Header;
+    SMB2HeaderConstruct(&Header);
+    Header.Status = Status;
+    Header.MessageId = MessageId;
+    if (BadProtocolByte >= 0) {
+      Header.ProtocolId[BadProtocolByte] = 'X';
+    }
+    return Console([&] { *Result = SMB2VerifyHeader(&Header, &TransactDetails); });
+  };
+  EFI_STATUS Result;
+  EXPECT_EQ(Check(0, 5, -1, &Result), "");
+  EXPECT_EQ(Result, EFI_SUCCESS);
+  EXPECT_EQ(Check(0, 4, -1, &Result),
+            "Response Message Id is incorrect! Id = 0x4, Expected = 0x5\n");
+  EXPECT_EQ(Result, EFI_SECURITY_VIOLATION);
+  std::string Out = Check(0, 5, 2, &Result);
+  EXPECT_EQ(Result, EFI_SECURITY_VIOLATION);
+  EXPECT_TRUE(Contains(Out, ", ProtocolId[2] = 0x4d\n") &&
+              Contains(Out, "->ProtocolId[2] = 0x58\n"));
+  // A continuation passes whatever its protocol id and message id.
+  Check(0xC0000016, 77, 0, &Result);
+  EXPECT_EQ(Result, EFI_SUCCESS);
+  EXPECT_EQ(Check(0xC0000022, 5, -1, &Result),
+            "SMB2VerifyHeader: Response Status returned error! Status = 0xc0000022\n");
+  EXPECT_EQ(Result, EFI_SECURITY_VIOLATION);
+  EXPECT_EQ(+TransactDetails.ResponseStatus, 0xC0000022u);
+}
+
+TEST_F(Smb2FramingTest, NtCodeMapping) {
+  struct Case {
+    UINT32 Code;
+    EFI_STATUS Status;
+    const char *Printed;
+  } Cases[] = {
+      {0, EFI_SUCCESS, ""},
+      {0xC0000001, EFI_DEVICE_ERROR,
+       "Function: F, Line no.: = 7, X returned unsuccessful! Status = 0xc0000001\n"},
+      {0x80070057, EFI_INVALID_PARAMETER,
+       "Function: F, Line no.: = 7, X returned invalid parameter! Status = 0x80070057\n"},
+      {0xC0000017, EFI_DEVICE_ERROR,
+       "Function: F, Line no.: = 7, X returned error! Status = 0xc0000017\n"},
+  };
+  for (const Case &C : Cases) {
+    EXPECT_EQ(Console([&] { EXPECT_EQ(SMB2MapNtStatus(C.Code, "X", "F", 7), C.Status); }),
+              C.Printed);
+  }
+}
+
+TEST_F(Smb2FramingTest, TreeConnectPathLimit) {
+  UINT8 *Packet = nullptr;
+  UINT32 Total = 0;
+  std::string Path(335, 'p');
+  ASSERT_EQ(SMB2TreeConnectPacketConstruct(Path.c_str(), &TransactDetails, &Packet, &Total),
+            EFI_SUCCESS);
+  EXPECT_EQ(Total, 335u * 2 + 78);
+  EXPECT_EQ(MockSmb::StreamLength(Bytes(Packet, Packet + 4)), Total - 4);
+  FreePool(Packet);
+  Path += 'p';
+  std::string Out = Console([&] {
+    EXPECT_EQ(SMB2TreeConnectPacketConstruct(Path.c_str(), &TransactDetails, &Packet, &Total),
+              EFI_INVALID_PARAMETER);
+  });
+  EXPECT_TRUE(Contains(Out, "Share name length 336 is longer than expected length 336\n"));
+}
+
+TEST_F(Smb2FramingTest, ConnectParameters) {
+  char User[] = "u", Password[] = "p", Ip[] = "10.1.2.3", Path[] = "\\\\10.1.2.3\\s";
+  SMB2ConnectInfo Info = {0, Ip, User, Password, nullptr};
+  SMB2ShareDetails Share = {Path, 0, 0, 0, 0};
+  std::string D256(256, 'd'), D257(257, 'd');
+  struct Case {
+    const char *Domain;
+    EFI_STATUS Expected;
+    const char *Message; // null: the domain is kept and the address field stays empty
+  } Cases[] = {
+      {"CORP", EFI_SUCCESS, nullptr},
+      {nullptr, EFI_SUCCESS,
+       "Domain is NULL! Continue to check using the domain sent by the server.\n"},
+      {"0", EFI_SUCCESS, "Domain is NULL!"},
+      {D256.c_str(), EFI_SUCCESS, "Domain is NULL!"},
+      {D257.c_str(), EFI_INVALID_PARAMETER,
+       "Domain length 257 is greater isexpected length 256. Exiting!\n"},
+  };
+  for (const Case &C : Cases) {
+    ZeroMem(&TransactDetails, sizeof(TransactDetails));
+    Info.Domain = const_cast<char *>(C.Domain);
+    std::string Out =
+        Console([&] { EXPECT_EQ(FillShareDetails(&Info, &Share, &TransactDetails), C.Expected); });
+    EXPECT_STREQ(TransactDetails.ShareDetails.DomainName, C.Message ? "" : C.Domain);
+    EXPECT_STREQ(TransactDetails.ShareDetails.ServerAddress, C.Message ? "10.1.2.3" : "");
+    EXPECT_TRUE(C.Message == nullptr || Contains(Out, C.Message)) << Out;
+  }
+  std::string Long(600, 'x');
+  Info = {0, Long.data(), Long.data(), Long.data(), nullptr};
+  ASSERT_EQ(FillShareDetails(&Info, &Share, &TransactDetails), EFI_SUCCESS);
+  EXPECT_EQ(strlen(TransactDetails.ShareDetails.UserName), 255u);
+  EXPECT_EQ(strlen(TransactDetails.ShareDetails.Password), 511u);
+  EXPECT_EQ(strlen(TransactDetails.ShareDetails.ServerAddress), 45u);
+  Info.Username = nullptr;
+  std::string Out = Console(
+      [&] { EXPECT_EQ(FillShareDetails(&Info, &Share, &TransactDetails), EFI_INVALID_PARAMETER); });
+  EXPECT_TRUE(Contains(Out, "Username is NULL!\n"));
+  EXPECT_STREQ(TransactDetails.ShareDetails.UserName, "");
+
+  // A connect with a bad domain stops before any network traffic.
+  Info = {0, Ip, User, Password, const_cast<char *>(D257.c_str())};
+  Out = Console([&] { EXPECT_EQ(SMB2_Connect(&Info, &Share), EFI_INVALID_PARAMETER); });
+  EXPECT_TRUE(Contains(Out, "FillShareDetails failed! Input details are incorrect!"));
+  EXPECT_EQ(gSMB2SockFd, 0);
+}
+
+TEST_F(Smb2FramingTest, AddressParsing) {
+  NwSockAddrIn A4 = {};
+  NwSockAddrIn6 A6 = {};
+  INT32 Domain = 0;
+  ASSERT_EQ(TCP_GetDomainTypeByIPAddress("192.168.1.10", &Domain, 445, &A4, &A6), 0);
+  EXPECT_EQ(Domain, 2);
+  EXPECT_EQ(Hex(reinterpret_cast<UINT8 *>(&A4), 8), "100201bdc0a8010a");
+  ASSERT_EQ(TCP_GetDomainTypeByIPAddress("fe80::1", &Domain, 445, &A4, &A6), 0);
+  EXPECT_EQ(Domain, 24);
+  EXPECT_EQ(Hex(reinterpret_cast<UINT8 *>(&A6), 24),
+            "1c1801bd00000000fe800000000000000000000000000001");
+  std::string Out = Console(
+      [&] { EXPECT_EQ(TCP_GetDomainTypeByIPAddress("fileserver", &Domain, 445, &A4, &A6), -1); });
+  EXPECT_TRUE(Contains(Out, "IP check failed! Status = 0x0 (0)")) << Out;
+}
+
+// The read-all loop over a socket pair: pieces are reassembled, and a peer
+// that stops sending ends the loop with its failure instead of a spin.
+TEST_F(Smb2FramingTest, ReadAllLoop) {
+  int Pair[2];
+  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, Pair), 0);
+  Bytes Message(100);
+  for (size_t I = 0; I < Message.size(); I++) {
+    Message[I] = static_cast<UINT8>(I);
+  }
+  std::thread Writer([&] {
+    for (size_t From : {0, 30, 70}) {
+      size_t To = From == 70 ? 100 : From == 30 ? 70 : 30;
+      EXPECT_EQ(write(Pair[1], Message.data() + From, To - From), ssize_t(To - From));
+      std::this_thread::sleep_for(std::chrono::milliseconds(30));
+    }
+  });
+  Bytes Got(100);
+  INT64 Total = 0;
+  EXPECT_EQ(TCP_PollAndTryToRxAllData(Pair[0], Got.data(), 100, 5, &Total), 0);
+  Writer.join();
+  EXPECT_EQ(Total, 100);
+  EXPECT_EQ(Got, Message);
+
+  ASSERT_EQ(write(Pair[1], Message.data(), 10), 10);
+  close(Pair[1]);
+  EXPECT_EQ(TCP_PollAndTryToRxAllData(Pair[0], Got.data(), 68, 5, &Total), -1);
+  EXPECT_EQ(Total, 10);
+  EXPECT_EQ(TCP_PollAndTryToRxAllData(Pair[0], Got.data(), 68, 5, &Total), -1);
+  EXPECT_EQ(Total, 0);
+
+  // Sending into the closed pair fails with the transport's status.
+  UINT32 Transport = 0;
+  std::string Out =
+      Console([&] { EXPECT_NE(SMB2SendRequest(Pair[0], Got.data(), 1, &Transport), 0u); });
+  EXPECT_EQ(Transport, 0xFFFFFFFFu);
+  EXPECT_TRUE(Contains(Out, "TCP_SendMessage failed! Status = 0xffffffff, Bytes sent = 0\n"))
+      << Out;
+  close(Pair[0]);
+}
+
+} // namespace
