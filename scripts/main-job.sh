@@ -7,14 +7,18 @@
 #
 # It then shows where the catalog landed in ramfs: and what the outcome
 # variable says. Everything lives under build/demo/.
+#
+#   BUILD_DIR  build directory of the hosted program (build/host)
+#   JOBS       parallel build jobs (ninja's default)
 set -euo pipefail
 cd "$(dirname "$0")/.."
 ROOT=$(pwd)
+BUILD_DIR=${BUILD_DIR:-build/host}
 
 bash scripts/install-deps.sh >/dev/null
 
-cmake -S . -B build/host -G Ninja -DCIFSDRV_PLATFORM=Host >/dev/null
-ninja -C build/host cifsdrv >/dev/null
+cmake -S . -B "$BUILD_DIR" -G Ninja -DCIFSDRV_PLATFORM=Host >/dev/null
+ninja -C "$BUILD_DIR" ${JOBS:+-j"$JOBS"} cifsdrv >/dev/null
 
 DEMO="$ROOT/build/demo"
 export SMB_SHARE=${SMB_SHARE:-provisioning}
@@ -41,10 +45,17 @@ chmod -R a+rwX "$SMB_DIR"
 
 bash scripts/samba-test-server.sh start
 
+# The text-field record "PUPROVISIONING_ENV_VAR" belongs to other firmware
+# components, which create it; the catalog action only writes the catalog's
+# directory into it. Start the demo with an empty one, so that the directory
+# is remembered.
+printf '{4D4AC77B-DD0A-447E-8117-104901DA8679} PUPROVISIONING_ENV_VAR 3 %s\n' \
+  "$(head -c 1152 /dev/zero | od -An -tx1 -v | tr -d ' \n')" >"$DEMO/vars.txt"
+
 echo "== Running: cifsdrv G $SMB_SHARE 127.0.0.1 $SMB_USER ********"
 set +e
 CIFSDRV_RAMFS="$DEMO/ramfs" CIFSDRV_VARSTORE="$DEMO/vars.txt" \
-  "$ROOT/build/host/cifsdrv" G "$SMB_SHARE" 127.0.0.1 "$SMB_USER" "$SMB_PASS" | tee "$DEMO/console.txt"
+  "$ROOT/$BUILD_DIR/cifsdrv" G "$SMB_SHARE" 127.0.0.1 "$SMB_USER" "$SMB_PASS" | tee "$DEMO/console.txt"
 rc=${PIPESTATUS[0]}
 set -e
 

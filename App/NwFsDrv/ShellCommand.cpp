@@ -135,7 +135,8 @@ void UpdateSystemTableCrc() {
 // Shell execution
 // ---------------------------------------------------------------------------
 
-// The shell protocol: the start-up binding, else whatever is installed now.
+} // namespace
+
 EFI_SHELL_PROTOCOL *CurrentShell() {
   if (gShellEnv2Found) {
     return gShellEnv2;
@@ -147,6 +148,8 @@ EFI_SHELL_PROTOCOL *CurrentShell() {
   }
   return Shell;
 }
+
+namespace {
 
 // One Execute call (parent image handle, command line, no environment). The
 // return value is the launch status; CommandStatus the command's own.

@@ -4,8 +4,11 @@
 //   CIFSDRV_VARSTORE  variable store file (default ./cifsdrv-vars.txt)
 //
 // The console shows exactly what the image prints; the exit code is the low
-// byte of the image's status.
+// byte of the image's status. Pool blocks or sockets the image leaves behind
+// are reported on stderr ("cifsdrv: left behind: ...") without changing the
+// exit code, so that scripts can check every run.
 #include "HostUefi.h"
+#include "NwPlatform.h"
 
 #include <stdio.h>
 #include <stdlib.h>
@@ -18,7 +21,15 @@ int main(int argc, char **argv) {
     fprintf(stderr, "cifsdrv: the hosted environment could not be set up\n");
     return 1;
   }
+  uint64_t PoolBefore = HostPoolOutstanding();
+  uint32_t SocketsBefore = NwOpenSocketCount();
   EFI_STATUS Status = HostRunImage(argc, argv);
+  uint64_t PoolLeft = HostPoolOutstanding() - PoolBefore;
+  uint32_t SocketsLeft = NwOpenSocketCount() - SocketsBefore;
+  if (PoolLeft != 0 || SocketsLeft != 0) {
+    fprintf(stderr, "cifsdrv: left behind: %llu pool blocks, %u sockets\n",
+            static_cast<unsigned long long>(PoolLeft), SocketsLeft);
+  }
   HostShutdown();
   return static_cast<int>(Status & 0xFF);
 }

@@ -1,214 +1,382 @@
-// The mount module: the driver binding and component name records, the
-// image's device path, gStaticFSProtocol, the share mount and unmount, and
-// the driver unload.
-//
-// The network volume is not attached to the mount in this build yet: the
-// mount operations fail with EFI_UNSUPPORTED and say so, and the unmount has
-// no volume to take down.
+// The share mount: a share name, a server address and credentials become a
+// Simple File System volume on the image's handle with a shell name, kept
+// alive by a timer, and are taken down again at unmount.
 #include "DiagLog.h"
 #include "NwBaseLib.h"
 #include "NwFsDrv.h"
+#include "ShellCommand.h"
+#include "Tasks.h"
+#include "volume/NWLib.h"
+#include "volume/NwVolume.h"
 
-const EFI_GUID gStaticFSProtocolGuid = {
-    0x9246E438, 0xFFD8, 0x42BE, {0xA2, 0x64, 0x70, 0x4D, 0xDB, 0x27, 0x3B, 0x78}};
-
-namespace {
-constexpr EFI_GUID kImageDevicePathGuid = {
-    0x802DE2AB, 0x9404, 0x4851, {0xB9, 0x1E, 0x89, 0xA6, 0x22, 0xD5, 0x67, 0x65}};
-}
-const EFI_GUID gNwFsImageDevicePathGuid = kImageDevicePathGuid;
-
-STATIC_FS_PROTOCOL gStaticFSProtocol = {MountStaticFileSystem, UnmountStaticFileSystem};
-
-EFI_DRIVER_BINDING_PROTOCOL gSimpleFileSystemDriverBinding = {SimpleFileSystemSupported,
-                                                              SimpleFileSystemStart,
-                                                              SimpleFileSystemStop,
-                                                              0x10000,
-                                                              nullptr,
-                                                              nullptr};
-
-EFI_COMPONENT_NAME_PROTOCOL gSimpleFileSystemComponentName = {
-    SimpleFileSystemGetDriverName, SimpleFileSystemGetControllerName, const_cast<CHAR8 *>("eng")};
-
-NWFS_IMAGE_DEVICE_PATH gNwFsImageDevicePath = {
-    {{0x01, 0x01, {sizeof(NWFS_VENDOR_NODE), 0}}, kImageDevicePathGuid, {0, 0, 0, 0, 0, 0, 0, 0}},
-    {END_DEVICE_PATH_TYPE, END_ENTIRE_DEVICE_PATH_SUBTYPE, {sizeof(EFI_DEVICE_PATH_PROTOCOL), 0}}};
+// The share type of the current mount and whether the network library has
+// been initialised for it.
+UINT64 gMountShareType = 0;
+BOOLEAN gNwLibInitialized = FALSE;
 
 namespace {
 
+constexpr const CHAR16 *kPlatformLangName = u"PlatformLang";
+constexpr UINTN kLanguageBytes = 10;
 constexpr UINTN kLanguageCompareChars = 3;
-constexpr const CHAR16 *kDriverName = u"PIOMISKU File System Driver";
+constexpr const CHAR8 *kDefaultLanguage = "eng";
+// The rewritten share name of the retry holds at most this many characters.
+constexpr UINTN kShareNameChars = 512;
+// Keep-alive: first firing after 10 seconds, then every 60 seconds while the
+// network is idle, or again after 10 seconds when it is busy (100 ns units).
+constexpr UINT64 kKeepAliveFirst = 100000000;
+constexpr UINT64 kKeepAliveIdle = 600000000;
+constexpr UINT64 kKeepAliveBusy = 100000000;
 
-BOOLEAN gSimpleFileSystemStarted = FALSE;
-EFI_HANDLE gStaticFSHandle = nullptr;
-
-bool LanguageIsEnglish(const CHAR8 *Language) {
-  return Language != nullptr && AsciiStrnCmp(Language, "eng", kLanguageCompareChars) == 0;
+// ---------------------------------------------------------------------------
+// Language and collation
+// ---------------------------------------------------------------------------
+void ReadPlatformLanguage(CHAR8 *Language) {
+  ZeroMem(Language, kLanguageBytes + 1);
+  UINTN Size = kLanguageBytes;
+  EFI_STATUS Status = gRT != nullptr ? gRT->GetVariable(kPlatformLangName, &gEfiGlobalVariableGuid,
+                                                        nullptr, &Size, Language)
+                                     : EFI_NOT_READY;
+  if (EFI_ERROR(Status) || Language[0] == 0) {
+    ZeroMem(Language, kLanguageBytes + 1);
+    AsciiStrCpyS(Language, kLanguageBytes + 1, kDefaultLanguage);
+  }
 }
 
-EFI_STATUS MountNotAttached(const CHAR8 *Function, UINT32 Line = __builtin_LINE()) {
-  // The network volume is not attached to the mount yet, so no share can be
-  // mounted: fail plainly rather than pretend.
-  DiagError("\nNetwork share mount is not attached in this build yet!", EFI_UNSUPPORTED, Function,
-            Line);
-  return EFI_UNSUPPORTED;
+// True when one of the 3-character groups of Supported begins like Language.
+bool SupportsLanguage(const CHAR8 *Supported, const CHAR8 *Language) {
+  if (Supported == nullptr) {
+    return false;
+  }
+  for (UINTN At = 0; AsciiStrnLen(Supported + At, kLanguageCompareChars) == kLanguageCompareChars;
+       At += kLanguageCompareChars) {
+    if (AsciiStrnCmp(Supported + At, Language, kLanguageCompareChars) == 0) {
+      return true;
+    }
+  }
+  return false;
+}
+
+// Finds the collation interface for Language once; later mounts reuse it.
+// EFI_UNSUPPORTED only when the handles cannot be listed or opened; with
+// handles but no match the mount goes on without one.
+EFI_STATUS FindUnicodeCollation(const CHAR8 *Language) {
+  if (gUnicodeCollationInterface != nullptr) {
+    return EFI_SUCCESS;
+  }
+  UINTN Count = 0;
+  EFI_HANDLE *Handles = nullptr;
+  EFI_STATUS Status = gBS->LocateHandleBuffer(ByProtocol, &gEfiUnicodeCollation2ProtocolGuid,
+                                              nullptr, &Count, &Handles);
+  for (UINTN Index = 0; !EFI_ERROR(Status) && Index < Count; Index++) {
+    EFI_UNICODE_COLLATION_PROTOCOL *Collation = nullptr;
+    Status = gBS->OpenProtocol(Handles[Index], &gEfiUnicodeCollation2ProtocolGuid,
+                               reinterpret_cast<void **>(&Collation), gImageHandle, nullptr,
+                               EFI_OPEN_PROTOCOL_GET_PROTOCOL);
+    if (!EFI_ERROR(Status) && SupportsLanguage(Collation->SupportedLanguages, Language)) {
+      gUnicodeCollationInterface = Collation;
+      break;
+    }
+  }
+  FreePool(Handles);
+  if (EFI_ERROR(Status)) {
+    gBS->CloseProtocol(gImageHandle, &gEfiUnicodeCollation2ProtocolGuid, gImageHandle, nullptr);
+    DiagError("Unicode Collation 2 not supported!", Status, "MountStaticFileSystem");
+    return EFI_UNSUPPORTED;
+  }
+  return EFI_SUCCESS;
+}
+
+// ---------------------------------------------------------------------------
+// Connection parameters and the share record
+// ---------------------------------------------------------------------------
+UINT32 ParseDecimal(const CHAR16 *Text) {
+  CHAR8 Narrow[32];
+  UnicodeStrToAsciiS(Text, Narrow, sizeof(Narrow));
+  return static_cast<UINT32>(AsciiStrDecimalToInt(Narrow));
+}
+
+void FreeConnectionParams(NW_CONNECTION_PARAMS *Params) {
+  FreePool(Params->ipAddress);
+  FreePool(Params->username);
+  FreePool(Params->password);
+  ZeroMem(Params, sizeof(*Params));
+}
+
+// Copies of the address and, for CIFS, of the credentials (absent ones as
+// empty texts); for NFS the credentials are numbers.
+EFI_STATUS BuildConnectionParams(const CHAR16 *IpAddress, UINT64 ShareType, const CHAR16 *UserName,
+                                 const CHAR16 *Password, NW_CONNECTION_PARAMS *Params) {
+  ZeroMem(Params, sizeof(*Params));
+  Params->ipAddress = StrDup(IpAddress != nullptr ? IpAddress : u"");
+  if (ShareType == NWFS_SHARE_TYPE_NFS) {
+    Params->uid = UserName != nullptr ? ParseDecimal(UserName) : 0;
+    Params->gid = Password != nullptr ? ParseDecimal(Password) : 0;
+  } else {
+    Params->username = StrDup(UserName != nullptr ? UserName : u"");
+    Params->password = StrDup(Password != nullptr ? Password : u"");
+  }
+  if (Params->ipAddress == nullptr ||
+      (ShareType != NWFS_SHARE_TYPE_NFS &&
+       (Params->username == nullptr || Params->password == nullptr))) {
+    FreeConnectionParams(Params);
+    DiagError("\nMemory allocation for the connection parameters failed!", EFI_OUT_OF_RESOURCES,
+              "MountStaticFileSystem");
+    return EFI_OUT_OF_RESOURCES;
+  }
+  return EFI_SUCCESS;
+}
+
+NW_SHARE_INFO *CreateShareRecord(const CHAR16 *ShareName, UINT64 ShareType) {
+  auto *Share = static_cast<NW_SHARE_INFO *>(AllocateZeroPool(sizeof(NW_SHARE_INFO)));
+  if (Share == nullptr) {
+    return nullptr;
+  }
+  if (ShareName != nullptr) {
+    Share->sharename = StrDup(ShareName);
+    if (Share->sharename == nullptr) {
+      FreePool(Share);
+      return nullptr;
+    }
+  }
+  Share->shareType = ShareType;
+  return Share;
+}
+
+void FreeShareRecord(NW_SHARE_INFO *Share) {
+  if (Share != nullptr) {
+    FreePool(Share->sharename);
+    FreePool(Share);
+  }
+}
+
+// ---------------------------------------------------------------------------
+// Keep-alive
+// ---------------------------------------------------------------------------
+
+// Tries the network busy lock without waiting; releases it again at once when
+// it was free. The lock record is packed, so its fields go through aligned
+// copies.
+bool NetworkWasIdle() {
+  UINT8 Busy = NetworkBusyLock.Busy;
+  EFI_EVENT LockEvent = NetworkBusyLock.Event;
+  bool Idle = AcquireNetworkBusyLock(&Busy, &LockEvent, FALSE) != FALSE;
+  if (Idle) {
+    ReleaseNetworkBusyLock(&Busy, &LockEvent);
+  }
+  NetworkBusyLock.Busy = Busy;
+  NetworkBusyLock.Event = LockEvent;
+  return Idle;
+}
+
+// Sends nothing: it only looks whether the network is in use and re-arms
+// itself, sooner when it is.
+void EFIAPI KeepAliveNotify(EFI_EVENT Event, void *) {
+  gBS->SetTimer(Event, TimerCancel, 0);
+  gBS->SetTimer(Event, TimerRelative, NetworkWasIdle() ? kKeepAliveIdle : kKeepAliveBusy);
+}
+
+EFI_STATUS StartKeepAlive(NW_SHARE_INFO *Share) {
+  EFI_STATUS Status = gBS->CreateEvent(EVT_TIMER | EVT_NOTIFY_SIGNAL, TPL_CALLBACK, KeepAliveNotify,
+                                       Share, &Share->KeepAliveEvent);
+  if (!EFI_ERROR(Status)) {
+    Status = gBS->SetTimer(Share->KeepAliveEvent, TimerRelative, kKeepAliveFirst);
+  }
+  if (EFI_ERROR(Status)) {
+    DiagError("\nCreating the keep-alive timer failed!", Status, "MountStaticFileSystem");
+  }
+  return Status;
+}
+
+// The volume this image installed on its handle, or null.
+NW_VOLUME *InstalledVolume() {
+  void *Interface = nullptr;
+  if (gBS->OpenProtocol(gImageHandle, &gEfiSimpleFileSystemProtocolGuid, &Interface, gImageHandle,
+                        nullptr, EFI_OPEN_PROTOCOL_GET_PROTOCOL) != EFI_SUCCESS) {
+    return nullptr;
+  }
+  return static_cast<NW_VOLUME *>(Interface);
+}
+
+// ---------------------------------------------------------------------------
+// The retry's share name
+// ---------------------------------------------------------------------------
+
+// Every separator of the kind met first becomes the other kind ("\" to "/",
+// or "/" to "\"). A name that mixes both is reported and still rewritten.
+void SwapShareNameSlashes(CHAR16 *Name) {
+  CHAR16 Separator = 0;
+  for (const CHAR16 *Scan = Name; *Scan != 0; Scan++) {
+    if (*Scan != u'\\' && *Scan != u'/') {
+      continue;
+    }
+    if (Separator == 0) {
+      Separator = *Scan;
+    } else if (*Scan != Separator) {
+      DiagLog(DIAG_ALWAYS, "Incorrent usage of slashes. Both '\\' and '/' are used.");
+      break;
+    }
+  }
+  if (Separator == 0) {
+    return;
+  }
+  CHAR16 Other = Separator == u'\\' ? u'/' : u'\\';
+  for (CHAR16 *Scan = Name; *Scan != 0; Scan++) {
+    if (*Scan == Separator) {
+      *Scan = Other;
+    }
+  }
+}
+
+// After a mount: the new volume is given a shell name, and is also mapped
+// under its identifier when that name differs. Only a command that cannot be
+// built fails.
+EFI_STATUS NameMountedVolume(const CHAR16 *Identifier) {
+  CHAR16 DriveName[NWFS_DRIVE_NAME_CHARS + 1] = {};
+  RefreshShellMappings();
+  GetFS_OLD_NWFS(Identifier, DriveName, NWFS_DRIVE_NAME_CHARS);
+  DiagLog(DIAG_VERBOSE, "driveName = %ls\n", DriveName);
+  if (DriveName[0] == 0) {
+    DiagLog(DIAG_ALWAYS, "Drive name len %ls is zero!\n", DriveName);
+    return EFI_SUCCESS;
+  }
+  DiagLog(DIAG_VERBOSE, "NWPartitions = %ls\n", DriveName);
+  if (!DriveNeedsIdentifierMapping(DriveName, Identifier)) {
+    return EFI_SUCCESS;
+  }
+  CHAR16 *Command = BuildMapCommand(Identifier, DriveName);
+  if (Command == nullptr) {
+    return EFI_OUT_OF_RESOURCES;
+  }
+  RunShellCommand(Command); // its result is deliberately not looked at
+  FreePool(Command);
+  return EFI_SUCCESS;
 }
 
 } // namespace
 
-// ---------------------------------------------------------------------------
-// Driver binding and component name
-// ---------------------------------------------------------------------------
-
-EFI_STATUS EFIAPI SimpleFileSystemSupported(EFI_DRIVER_BINDING_PROTOCOL *, EFI_HANDLE,
-                                            EFI_DEVICE_PATH_PROTOCOL *) {
-  return EFI_SUCCESS;
-}
-
-EFI_STATUS EFIAPI SimpleFileSystemStart(EFI_DRIVER_BINDING_PROTOCOL *This,
-                                        EFI_HANDLE ControllerHandle, EFI_DEVICE_PATH_PROTOCOL *) {
-  if (gSimpleFileSystemStarted) {
-    return EFI_ALREADY_STARTED;
-  }
-  DiagLog(DIAG_ALWAYS, "*** SimpleFileSystemStart, Controller: 0x%x\n",
-          static_cast<UINT32>(reinterpret_cast<UINTN>(ControllerHandle)));
-  DiagLog(DIAG_ALWAYS, "gEfiDevicePathProtocolGuid: 0x%x\n",
-          static_cast<UINT32>(reinterpret_cast<UINTN>(&gEfiDevicePathProtocolGuid)));
-  DiagLog(DIAG_ALWAYS, "This->DriverBindingHandle: 0x%x\n",
-          static_cast<UINT32>(reinterpret_cast<UINTN>(This->DriverBindingHandle)));
-  void *DevicePath = nullptr;
-  EFI_STATUS Status =
-      gBS->OpenProtocol(ControllerHandle, &gEfiDevicePathProtocolGuid, &DevicePath,
-                        This->DriverBindingHandle, ControllerHandle, EFI_OPEN_PROTOCOL_BY_DRIVER);
+EFI_STATUS StartMountFileSystem(const CHAR16 *ShareName, const CHAR16 *IpAddress, UINT64 ShareType,
+                                const CHAR16 *UserName, const CHAR16 *Password) {
+  const CHAR16 *Identifier = ShareVolumeIdentifier(ShareType);
+  EFI_STATUS Status = MountStaticFileSystem(ShareName, IpAddress, ShareType, UserName, Password);
   if (EFI_ERROR(Status)) {
-    DiagLog(DIAG_ALWAYS, "OpenProtocol, Controller: 0x%x, Status: 0x%x\n",
-            static_cast<UINT32>(reinterpret_cast<UINTN>(ControllerHandle)),
+    DiagLog(DIAG_ALWAYS, "MountStaticFileSystem failed! Status = 0x%x. Unmounting...\n",
             static_cast<UINT32>(Status));
-    Status = EFI_UNSUPPORTED;
-  } else {
-    gStaticFSHandle = nullptr;
-    Status = gBS->InstallProtocolInterface(&gStaticFSHandle, &gStaticFSProtocolGuid,
-                                           EFI_NATIVE_INTERFACE, &gStaticFSProtocol);
-    DiagLog(DIAG_VERBOSE, "InstallProtocolInterface, gStaticFSProtocol: 0x%x, Status: 0x%x\n",
-            static_cast<UINT32>(reinterpret_cast<UINTN>(&gStaticFSProtocol)),
-            static_cast<UINT32>(Status));
-    gSimpleFileSystemStarted = TRUE;
+    UnmountStaticFileSystem(ShareName, IpAddress);
+    CHAR16 *Rewritten = static_cast<CHAR16 *>(AllocateZeroPool(kShareNameChars * sizeof(CHAR16)));
+    if (Rewritten == nullptr) {
+      DiagLog(DIAG_ALWAYS, "Memory allocation falied for modified shareName\n");
+      return EFI_OUT_OF_RESOURCES;
+    }
+    StrCpyS(Rewritten, kShareNameChars, ShareName != nullptr ? ShareName : u"");
+    SwapShareNameSlashes(Rewritten);
+    Status = MountStaticFileSystem(Rewritten, IpAddress, ShareType, UserName, Password);
+    FreePool(Rewritten);
+    if (EFI_ERROR(Status)) {
+      DiagLog(DIAG_ALWAYS, "Failed to mount: %ls, Status: 0x%X\n", ShareName,
+              static_cast<UINT32>(Status));
+      return Status;
+    }
   }
-  DiagLog(DIAG_ALWAYS, "Exiting isStarted: %d, Status: 0x%x\n", gSimpleFileSystemStarted,
-          static_cast<UINT32>(Status));
-  return Status;
-}
-
-EFI_STATUS EFIAPI SimpleFileSystemStop(EFI_DRIVER_BINDING_PROTOCOL *This,
-                                       EFI_HANDLE ControllerHandle, UINTN NumberOfChildren,
-                                       EFI_HANDLE *) {
-  if (NumberOfChildren != 0) {
-    return EFI_UNSUPPORTED;
+  if (Status == EFI_SUCCESS) {
+    EFI_STATUS NameStatus = NameMountedVolume(Identifier);
+    if (EFI_ERROR(NameStatus)) {
+      return NameStatus;
+    }
   }
-  if (gStaticFSHandle != nullptr) {
-    gBS->UninstallProtocolInterface(gStaticFSHandle, &gStaticFSProtocolGuid, &gStaticFSProtocol);
-    gStaticFSHandle = nullptr;
-  }
-  gBS->CloseProtocol(ControllerHandle, &gEfiDevicePathProtocolGuid, This->DriverBindingHandle,
-                     ControllerHandle);
-  gSimpleFileSystemStarted = FALSE;
-  return EFI_SUCCESS;
-}
-
-EFI_STATUS EFIAPI SimpleFileSystemGetDriverName(EFI_COMPONENT_NAME_PROTOCOL *, CHAR8 *Language,
-                                                CHAR16 **DriverName) {
-  if (DriverName == nullptr || !LanguageIsEnglish(Language)) {
-    return EFI_UNSUPPORTED;
-  }
-  *DriverName = const_cast<CHAR16 *>(kDriverName);
-  return EFI_SUCCESS;
-}
-
-EFI_STATUS EFIAPI SimpleFileSystemGetControllerName(EFI_COMPONENT_NAME_PROTOCOL *,
-                                                    EFI_HANDLE ControllerHandle,
-                                                    EFI_HANDLE ChildHandle, CHAR8 *Language,
-                                                    CHAR16 **ControllerName) {
-  if (ChildHandle != nullptr || ControllerName == nullptr || !LanguageIsEnglish(Language)) {
-    return EFI_UNSUPPORTED;
-  }
-  void *Volume = nullptr;
-  EFI_STATUS Status =
-      gBS->OpenProtocol(ControllerHandle, &gEfiSimpleFileSystemProtocolGuid, &Volume, gImageHandle,
-                        ControllerHandle, EFI_OPEN_PROTOCOL_GET_PROTOCOL);
-  if (EFI_ERROR(Status)) {
-    return Status;
-  }
-  // The controller name lives in the network volume's record, which is not
-  // attached in this build yet: no volume on any controller is this image's.
-  return EFI_UNSUPPORTED;
-}
-
-EFI_STATUS InstallImageProtocols(EFI_HANDLE ImageHandle) {
-  gSimpleFileSystemDriverBinding.ImageHandle = ImageHandle;
-  gSimpleFileSystemDriverBinding.DriverBindingHandle = ImageHandle;
-  EFI_HANDLE Handle = ImageHandle;
-  EFI_STATUS Status = gBS->InstallMultipleProtocolInterfaces(&Handle, &gEfiDevicePathProtocolGuid,
-                                                             &gNwFsImageDevicePath, nullptr);
-  if (EFI_ERROR(Status)) {
-    DiagError("\nInstalling the image device path failed!", Status, "ShellCEntryLib");
-  }
-  Status = gBS->InstallMultipleProtocolInterfaces(
-      &Handle, &gEfiDriverBindingProtocolGuid, &gSimpleFileSystemDriverBinding,
-      &gEfiComponentNameProtocolGuid, &gSimpleFileSystemComponentName, nullptr);
-  if (EFI_ERROR(Status)) {
-    DiagError("\nInstalling the driver binding failed!", Status, "ShellCEntryLib");
-  }
-  return Status;
-}
-
-// ---------------------------------------------------------------------------
-// Mount and unmount
-// ---------------------------------------------------------------------------
-
-EFI_STATUS StartMountFileSystem(const CHAR16 *, const CHAR16 *, UINT64, const CHAR16 *,
-                                const CHAR16 *) {
-  // Not attached yet: the network volume that this mounts comes later.
-  EFI_STATUS Status = MountNotAttached("StartMountFileSystem");
   DiagExit(Status, DiagChannel::Driver, "StartMountFileSystem");
   return Status;
 }
 
-EFI_STATUS EFIAPI MountStaticFileSystem(const CHAR16 *, const CHAR16 *, UINT64, const CHAR16 *,
-                                        const CHAR16 *) {
-  // Not attached yet: the network volume that this mounts comes later.
-  return MountNotAttached("MountStaticFileSystem");
-}
+EFI_STATUS EFIAPI MountStaticFileSystem(const CHAR16 *ShareName, const CHAR16 *IpAddress,
+                                        UINT64 ShareType, const CHAR16 *UserName,
+                                        const CHAR16 *Password) {
+  DiagShortEntry(DiagChannel::Driver, "MountStaticFileSystem");
+  DiagLog(DIAG_VERBOSE, "shareName = %ls\n", ShareName);
+  DiagLog(DIAG_VERBOSE, "ipAddress = %ls\n", IpAddress);
+  DiagLog(DIAG_VERBOSE, "shareType = %d\n", static_cast<INT32>(ShareType));
 
-EFI_STATUS EFIAPI UnmountStaticFileSystem(const CHAR16 *, const CHAR16 *) {
-  DiagShortEntry(DiagChannel::Driver, "UnmountStaticFileSystem");
-  // No volume of this image can be installed until the network volume is
-  // attached, so there is nothing to uninstall or disconnect, and the network
-  // library whose de-initialisation belongs here is not attached either. As
-  // with any unmount of nothing, the result is success.
-  EFI_STATUS Status = EFI_SUCCESS;
-  DiagShortExit(Status, '.', DiagChannel::Driver, "UnmountStaticFileSystem");
+  CHAR8 Language[kLanguageBytes + 1];
+  ReadPlatformLanguage(Language);
+  EFI_STATUS Status = FindUnicodeCollation(Language);
+  if (EFI_ERROR(Status)) {
+    return Status;
+  }
+  if (!gNwLibInitialized) {
+    Status = GEE_NWInit(gImageHandle, gST, ShareType);
+    if (EFI_ERROR(Status)) {
+      DiagError("Couldn't Init NWLib!", Status, "MountStaticFileSystem");
+      return EFI_DEVICE_ERROR;
+    }
+    gNwLibInitialized = TRUE;
+  }
+
+  NW_CONNECTION_PARAMS Params;
+  Status = BuildConnectionParams(IpAddress, ShareType, UserName, Password, &Params);
+  if (EFI_ERROR(Status)) {
+    return Status;
+  }
+  NW_SHARE_INFO *Share = CreateShareRecord(ShareName, ShareType);
+  if (Share == nullptr) {
+    FreeConnectionParams(&Params);
+    DiagError("\nMemory allocation for the share record failed!", EFI_OUT_OF_RESOURCES,
+              "MountStaticFileSystem");
+    return EFI_OUT_OF_RESOURCES;
+  }
+  gMountShareType = ShareType;
+
+  Status = GEE_NWFSConnect(&Params, Share);
+  if (EFI_ERROR(Status)) {
+    if (Status == EFI_DEVICE_ERROR) {
+      // The retry initialises the library again.
+      GEE_NWDeInit(ShareType);
+      gNwLibInitialized = FALSE;
+    }
+    DiagLog(DIAG_ALWAYS, "Couldn't Connect to the share directory, Status: 0x%X\n",
+            static_cast<UINT32>(Status));
+    FreeShareRecord(Share); // nothing refers to it after a failed connect
+  } else {
+    Status = DetectInstallVolume(gImageHandle, Language, Share, Params.ipAddress, Params.username,
+                                 Params.password);
+    if (!EFI_ERROR(Status)) {
+      Status = StartKeepAlive(Share);
+    } else {
+      DiagLog(DIAG_ALWAYS, "DetectInstallVolume failed! Status: 0x%x\n",
+              static_cast<UINT32>(Status));
+      if (InstalledVolume() == nullptr) {
+        // Nothing for the unmount to find: let go of the connection here.
+        GEE_NWFSDisconnect(Share, Params.ipAddress);
+        FreeShareRecord(Share);
+      }
+    }
+  }
+  FreeConnectionParams(&Params);
+  DiagShortExit(Status, ',', DiagChannel::Driver, "MountStaticFileSystem");
   return Status;
 }
 
-EFI_STATUS UnloadSimpleFileSystemDriver(EFI_HANDLE ImageHandle) {
-  DiagEntry(DiagChannel::Driver, "UnloadSimpleFileSystemDriver");
-  UINTN Count = 0;
-  EFI_HANDLE *Handles = nullptr;
-  EFI_STATUS Status = gBS->LocateHandleBuffer(AllHandles, nullptr, nullptr, &Count, &Handles);
-  if (EFI_ERROR(Status)) {
-    DiagError("\nLocateHandleBuffer() failed - exiting from unloadsimplefilesystemprotocol()",
-              Status, "UnloadSimpleFileSystemDriver");
-    return Status;
+EFI_STATUS EFIAPI UnmountStaticFileSystem(const CHAR16 *, const CHAR16 *IpAddress) {
+  DiagShortEntry(DiagChannel::Driver, "UnmountStaticFileSystem");
+  EFI_STATUS Status = EFI_SUCCESS;
+  NW_VOLUME *Volume = InstalledVolume();
+  if (Volume != nullptr) {
+    NW_SHARE_INFO *Share = Volume->shareInfo;
+    Status = RemoveInstalledVolume(Volume);
+    if (!EFI_ERROR(Status) && Share != nullptr) {
+      GEE_NWFSDisconnect(Share, IpAddress);
+      gMountShareType = Share->shareType;
+      if (Share->KeepAliveEvent != nullptr) {
+        EFI_STATUS CloseStatus = gBS->CloseEvent(Share->KeepAliveEvent);
+        DiagErrorAt(DiagChannel::Driver, DIAG_VERBOSE, "CloseEvent returned. ", CloseStatus,
+                    "UnmountStaticFileSystem");
+        Share->KeepAliveEvent = nullptr;
+      }
+      FreeShareRecord(Share);
+    }
   }
-  for (UINTN Index = 0; Index < Count; Index++) {
-    Status = gBS->DisconnectController(Handles[Index], ImageHandle, nullptr);
-  }
-  FreePool(Handles);
-  Status = gBS->UninstallProtocolInterface(ImageHandle, &gEfiDevicePathProtocolGuid,
-                                           &gNwFsImageDevicePath);
-  Status = gBS->UninstallMultipleProtocolInterfaces(
-      ImageHandle, &gEfiDriverBindingProtocolGuid, &gSimpleFileSystemDriverBinding,
-      &gEfiComponentNameProtocolGuid, &gSimpleFileSystemComponentName, nullptr);
-  DiagExit(Status, DiagChannel::Driver, "UnloadSimpleFileSystemDriver");
+  GEE_NWDeInit(gMountShareType);
+  gNwLibInitialized = FALSE;
+  gMountShareType = 0;
+  DiagShortExit(Status, '.', DiagChannel::Driver, "UnmountStaticFileSystem");
   return Status;
 }

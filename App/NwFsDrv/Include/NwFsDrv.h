@@ -108,7 +108,13 @@ EFI_STATUS EFIAPI SimpleFileSystemGetControllerName(EFI_COMPONENT_NAME_PROTOCOL 
 // the image handle (two calls, as the entry does).
 EFI_STATUS InstallImageProtocols(EFI_HANDLE ImageHandle);
 
-// Mounts the share as a file-system volume and gives it a shell name.
+// The share type of the current mount (0 when nothing is mounted) and whether
+// the network library has been initialised for it.
+extern UINT64 gMountShareType;
+extern BOOLEAN gNwLibInitialized;
+
+// Mounts the share as a file-system volume and gives it a shell name. A
+// failed mount is retried once with the share name's slashes swapped.
 EFI_STATUS StartMountFileSystem(const CHAR16 *ShareName, const CHAR16 *IpAddress, UINT64 ShareType,
                                 const CHAR16 *UserName, const CHAR16 *Password);
 EFI_STATUS EFIAPI MountStaticFileSystem(const CHAR16 *ShareName, const CHAR16 *IpAddress,

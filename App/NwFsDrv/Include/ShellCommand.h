@@ -46,6 +46,10 @@ EFI_STATUS LocateShellEnvironment(const CHAR8 *Function, UINT32 Line = __builtin
 // version of 1 or more.
 EFI_STATUS InitializeSystemEnv(EFI_HANDLE ImageHandle, EFI_SYSTEM_TABLE *SystemTable);
 
+// The shell protocol: the start-up binding, else whatever is installed now;
+// null without one.
+EFI_SHELL_PROTOCOL *CurrentShell();
+
 // Runs one command line through the shell binding. EFI_INVALID_PARAMETER for
 // a null command or without the binding; otherwise the command's status (or
 // the launch failure).

@@ -1,0 +1,144 @@
+// Actions I and "e ... Import": one file is copied from the mounted share into
+// ramfs:. Action S: the catalog's signature file is copied from the catalog
+// directory that action G remembered.
+#include "DiagLog.h"
+#include "NwBaseLib.h"
+#include "ProvisioningVars.h"
+#include "ShellCommand.h"
+#include "Tasks.h"
+#include "tasks/TaskSupport.h"
+
+namespace {
+
+constexpr const CHAR8 *kSignatureFileName = "catalog.xml.gz.sign";
+
+void PrintCopyCommand(const CHAR16 *Identifier, const CHAR16 *FilePath, const CHAR16 *DestPath,
+                      const CHAR16 *Command, UINT32 Line = __builtin_LINE()) {
+  DiagLog(DIAG_ALWAYS, "\n NWPartitions = [%ls]\n", Identifier);
+  DiagLog(DIAG_ALWAYS, "\n filePath = [%ls]\n", FilePath);
+  DiagLog(DIAG_ALWAYS, "\n destFilePath = [%ls]\n", DestPath);
+  DiagLog(DIAG_ALWAYS, "\n (%d)command = [%ls]\n", Line, Command);
+}
+
+void PrintStatus(EFI_STATUS Status, UINT32 Line = __builtin_LINE()) {
+  DiagLog(DIAG_ALWAYS, "\n (%d)Status = [%d]\n", Line, static_cast<INT32>(Status));
+}
+
+void ReplaceForwardSlashes(CHAR16 *Text) {
+  for (; *Text != 0; Text++) {
+    if (*Text == u'/') {
+      *Text = u'\\';
+    }
+  }
+}
+
+// One copy attempt: true when the check path opens afterwards, whatever the
+// command reported. Otherwise *Status is the runner's result when it could
+// not launch the command, else the command's own status: a copy that worked
+// but whose file lies elsewhere than the check expects stays a success, while
+// a copy that failed is reported with its failure.
+bool AttemptCopy(const CHAR16 *Command, const CHAR16 *CheckPath, EFI_STATUS *Status) {
+  INTN RunnerResult = RunShellCommand(Command);
+  if (ShellFileOpens(CheckPath)) {
+    *Status = EFI_SUCCESS;
+    return true;
+  }
+  *Status = RunnerResult != 0 ? static_cast<EFI_STATUS>(RunnerResult) : gLastCommandStatus;
+  return false;
+}
+
+// Maps the share under its identifier when its shell name differs. Returns
+// false (with *Status set) when the import cannot go on.
+bool MapShareForImport(const CHAR16 *Identifier, EFI_STATUS *Status) {
+  CHAR16 DriveName[NWFS_DRIVE_NAME_CHARS + 1] = {};
+  GetFS_OLD_NWFS(Identifier, DriveName, NWFS_DRIVE_NAME_CHARS);
+  if (!DriveNeedsIdentifierMapping(DriveName, Identifier)) {
+    return true;
+  }
+  CHAR16 *Command = BuildMapCommand(Identifier, DriveName);
+  if (Command == nullptr) {
+    *Status = EFI_OUT_OF_RESOURCES;
+    return false;
+  }
+  DiagLog(DIAG_ALWAYS, "\n 1 .)command = [%ls]\n", Command);
+  INTN RunnerResult = RunShellCommand(Command);
+  if (RunnerResult != 0) {
+    DiagLogW(DIAG_ALWAYS, u"GetFileFromNWFS(): command failed, %s\n", Command);
+    *Status = static_cast<EFI_STATUS>(RunnerResult);
+    PrintStatus(*Status);
+  }
+  FreePool(Command);
+  return RunnerResult == 0;
+}
+
+} // namespace
+
+EFI_STATUS GetFileFromNWFS(UINT32 ShareType, const CHAR16 *FilePath, const CHAR16 *DestPath) {
+  DiagEntry(DiagChannel::Driver, "GetFileFromNWFS");
+  if (FilePath == nullptr || DestPath == nullptr) {
+    DiagError("\nImport file path is NULL!", EFI_NOT_FOUND, "GetFileFromNWFS");
+    return EFI_NOT_FOUND;
+  }
+  const CHAR16 *Identifier = ShareVolumeIdentifier(ShareType);
+  EFI_STATUS Status = EFI_SUCCESS;
+  if (!MapShareForImport(Identifier, &Status)) {
+    return Status;
+  }
+
+  const CHAR16 *CopyParts[] = {u"cp -q ", Identifier, u":\\", FilePath, u" ", DestPath};
+  CHAR16 *Command = JoinText(CopyParts);
+  if (Command == nullptr) {
+    DiagLog(DIAG_ALWAYS, "Memory allocation error for Command \n");
+    return EFI_OUT_OF_RESOURCES;
+  }
+  PrintCopyCommand(Identifier, FilePath, DestPath, Command);
+
+  // The check keeps the file path's directories: it finds the copy only when
+  // they exist under the destination too.
+  const CHAR16 *CheckParts[] = {DestPath, FilePath};
+  CHAR16 *CheckPath = JoinText(CheckParts);
+  CHAR8 *CheckPath8 = CheckPath != nullptr ? UnicodeStrDupToAscii(CheckPath) : nullptr;
+  if (CheckPath8 == nullptr) {
+    DiagLog(DIAG_ALWAYS, "\n Memory allocation error for Command \n");
+    FreePool(CheckPath);
+    FreePool(Command);
+    return EFI_OUT_OF_RESOURCES;
+  }
+  DiagLog(DIAG_ALWAYS, "\n (%d)fileCheck = [%ls]\n", __LINE__, CheckPath);
+  DiagLog(DIAG_ALWAYS, "\n fileCheck8 = [%s]\n", CheckPath8);
+
+  if (!AttemptCopy(Command, CheckPath, &Status)) {
+    // A path written with '/' that the shell could not resolve: once more
+    // with every '/' turned into '\'.
+    ReplaceForwardSlashes(Command);
+    PrintCopyCommand(Identifier, FilePath, DestPath, Command);
+    if (!AttemptCopy(Command, CheckPath, &Status)) {
+      DiagLogW(DIAG_ALWAYS, u"GetFileFromNWFS(): command failed, %s\n", Command);
+    }
+  }
+  PrintStatus(Status);
+  FreePool(CheckPath8);
+  FreePool(CheckPath);
+  FreePool(Command);
+  return Status;
+}
+
+EFI_STATUS CopyCatalogSignatureToRamfs() {
+  PU_PROVISIONING_RECORD Record;
+  if (GetPUProvisioningEnvVar(&Record) == nullptr) {
+    return EFI_SUCCESS; // nothing remembered, nothing to copy
+  }
+  // The field is NUL-terminated within its 128 bytes once it passed the
+  // record's check; terminate it anyway so the join never runs past it.
+  Record.CifsCatalogPath[PROVISIONING_TEXT_BYTES - 1] = 0;
+  const CHAR8 *Parts[] = {"cp -q ",  Record.CifsCatalogPath, "\\", kSignatureFileName, " ",
+                          "ramfs:\\"};
+  CHAR8 *Command = JoinAscii(Parts);
+  if (Command == nullptr) {
+    DiagLog(DIAG_ALWAYS, "\nfailed to allocate memory for command");
+    return EFI_OUT_OF_RESOURCES;
+  }
+  EFI_STATUS Status = RunSystemCommand(Command);
+  FreePool(Command);
+  return Status;
+}

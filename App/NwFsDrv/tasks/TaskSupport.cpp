@@ -1,0 +1,115 @@
+// Text joining, the shell "system" call and the file existence check shared
+// by the catalog, import and export tasks, and the mapping of the mounted
+// share under its volume identifier.
+#include "tasks/TaskSupport.h"
+
+#include "DiagLog.h"
+#include "NwBaseLib.h"
+#include "NwFsDrv.h"
+#include "ShellCommand.h"
+#include "Tasks.h"
+
+namespace {
+
+template <typename CharT>
+UINTN TextLength(const CharT *Text) {
+  UINTN Length = 0;
+  while (Text != nullptr && Text[Length] != 0) {
+    Length++;
+  }
+  return Length;
+}
+
+template <typename CharT>
+CharT *JoinParts(const CharT *const *Parts, UINTN Count) {
+  UINTN Total = 1;
+  for (UINTN Index = 0; Index < Count; Index++) {
+    Total += TextLength(Parts[Index]);
+  }
+  CharT *Joined = static_cast<CharT *>(AllocatePool(Total * sizeof(CharT)));
+  if (Joined == nullptr) {
+    return nullptr;
+  }
+  UINTN At = 0;
+  for (UINTN Index = 0; Index < Count; Index++) {
+    UINTN Length = TextLength(Parts[Index]);
+    CopyMem(Joined + At, Parts[Index], Length * sizeof(CharT));
+    At += Length;
+  }
+  Joined[At] = 0;
+  return Joined;
+}
+
+// The runner's result as a status: the command's own status once the shell
+// launched it, else the launch failure.
+EFI_STATUS CommandOutcome(INTN RunnerResult) {
+  if (RunnerResult == 1) {
+    return EFI_INVALID_PARAMETER; // no command line at all
+  }
+  return gLastCommandStatus;
+}
+
+} // namespace
+
+CHAR16 *JoinText(const CHAR16 *const *Parts, UINTN Count) {
+  return JoinParts(Parts, Count);
+}
+
+CHAR8 *JoinAscii(const CHAR8 *const *Parts, UINTN Count) {
+  return JoinParts(Parts, Count);
+}
+
+EFI_STATUS RunSystemCommand(const CHAR8 *CommandLine) {
+  return CommandOutcome(RunShellCommandAscii(CommandLine));
+}
+
+EFI_STATUS RunSystemCommandW(const CHAR16 *CommandLine) {
+  return CommandOutcome(RunShellCommand(CommandLine));
+}
+
+bool ShellFileOpens(const CHAR16 *Path) {
+  EFI_SHELL_PROTOCOL *Shell = CurrentShell();
+  if (Path == nullptr || Shell == nullptr || Shell->OpenFileByName == nullptr) {
+    return false;
+  }
+  SHELL_FILE_HANDLE File = nullptr;
+  if (Shell->OpenFileByName(Path, &File, EFI_FILE_MODE_READ) != EFI_SUCCESS || File == nullptr) {
+    return false;
+  }
+  Shell->CloseFile(File);
+  return true;
+}
+
+bool ShellFileOpensAscii(const CHAR8 *Path) {
+  CHAR16 *Wide = AsciiStrDupToUnicode(Path);
+  bool Opens = Wide != nullptr && ShellFileOpens(Wide);
+  FreePool(Wide);
+  return Opens;
+}
+
+// ---------------------------------------------------------------------------
+// The mounted share's shell name
+// ---------------------------------------------------------------------------
+
+const CHAR16 *ShareVolumeIdentifier(UINT64 ShareType) {
+  return ShareType == NWFS_SHARE_TYPE_CIFS ? u"CIFS" : u"NFS";
+}
+
+bool DriveNeedsIdentifierMapping(const CHAR16 *DriveName, const CHAR16 *Identifier) {
+  return DriveName != nullptr && DriveName[0] != 0 &&
+         StrnCmp(DriveName, Identifier, StrLen(Identifier)) != 0;
+}
+
+CHAR16 *BuildMapCommand(const CHAR16 *Identifier, const CHAR16 *DriveName) {
+  constexpr const CHAR16 *kMap = u"map";
+  // "map", the two spaces, the drive name, its colon and the terminator.
+  UINTN Chars = StrLen(kMap) + StrLen(Identifier) + 2 + StrLen(DriveName) + 2;
+  CHAR16 *Command = static_cast<CHAR16 *>(AllocateZeroPool(Chars * sizeof(CHAR16)));
+  if (Command == nullptr) {
+    DiagLog(DIAG_ALWAYS, "Memory allocation error for Command \n");
+    return nullptr;
+  }
+  UnicodeSPrint(Command, Chars, u"%s %s %s:", kMap, Identifier, DriveName);
+  DiagLogW(DIAG_ALWAYS, u"trying to map --> command: %s\n", Command);
+  return Command;
+}

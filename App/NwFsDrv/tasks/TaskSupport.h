@@ -1,0 +1,29 @@
+// Pieces every provisioning task shares: text joining into pool strings, the
+// shell "system" call, and the existence check of a file through the shell.
+#pragma once
+
+#include "Uefi.h"
+
+// Joins the parts (null parts count as empty) into one pool string. Null when
+// the pool is exhausted; the caller frees the result.
+CHAR16 *JoinText(const CHAR16 *const *Parts, UINTN Count);
+CHAR8 *JoinAscii(const CHAR8 *const *Parts, UINTN Count);
+
+template <UINTN N>
+CHAR16 *JoinText(const CHAR16 *const (&Parts)[N]) {
+  return JoinText(Parts, N);
+}
+template <UINTN N>
+CHAR8 *JoinAscii(const CHAR8 *const (&Parts)[N]) {
+  return JoinAscii(Parts, N);
+}
+
+// Runs a command line through the shell and returns the command's own status
+// (or the reason it could not be launched), as a C library's system() does.
+EFI_STATUS RunSystemCommand(const CHAR8 *CommandLine);
+EFI_STATUS RunSystemCommandW(const CHAR16 *CommandLine);
+
+// True when Path opens for reading through the shell; the file is closed
+// again at once.
+bool ShellFileOpens(const CHAR16 *Path);
+bool ShellFileOpensAscii(const CHAR8 *Path);

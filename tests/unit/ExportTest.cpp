@@ -1,0 +1,439 @@
+// The export side: the source-type classification, the destination on the
+// share, the three export tasks against the stand-in share, and the two
+// readers the exported names come from (SMBIOS asset tag, sysInfo.xml), fed
+// with malformed input.
+#include "ExportToNWFS/ExportTasks.h"
+#include "NwFsDrv.h"
+#include "ShareStandIn.h"
+#include "Tasks.h"
+
+#include <regex>
+
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr const char *kSysInfo = "<SystemInfo>\n"
+                                 "  <ServiceTag>7XK4Q2R</ServiceTag>\n"
+                                 "  <TimeStamp>2024-02-29T23:05:09</TimeStamp>\n"
+                                 "</SystemInfo>\n";
+
+class ExportTest : public ShareTaskTest {
+protected:
+  EFI_STATUS Export(const CHAR16 *SourceType, const CHAR16 *FileName = nullptr,
+                    UINT32 ShareType = NWFS_SHARE_TYPE_CIFS, std::string *Out = nullptr) {
+    EFI_STATUS Status = EFI_SUCCESS;
+    std::string Text =
+        Console([&] { Status = ExporttoNWShare(ShareType, FileName, u"Export", SourceType); });
+    if (Out != nullptr) {
+      *Out = Text;
+    }
+    return Status;
+  }
+
+  // Names of the files in a directory of the share.
+  std::vector<std::string> SharedFiles(const std::string &Directory = "") const {
+    std::vector<std::string> Names;
+    for (const auto &Entry : fs::directory_iterator(ShareDir + "/" + Directory)) {
+      if (Entry.is_regular_file()) {
+        Names.push_back(Entry.path().filename().string());
+      }
+    }
+    std::sort(Names.begin(), Names.end());
+    return Names;
+  }
+};
+
+// ---------------------------------------------------------------------------
+// Classification and destination
+// ---------------------------------------------------------------------------
+
+TEST_F(ExportTest, SourceTypesAreClassifiedWholeExceptTheReportPrefix) {
+  struct Case {
+    const CHAR16 *SourceType;
+    UINT32 Kind;
+  };
+  const Case Cases[] = {
+      {u"VML", EXPORT_KIND_LOG},
+      {u"HWI", EXPORT_KIND_HW_INVENTORY},
+      {u"ASI", EXPORT_KIND_SW_INVENTORY},
+      {u"BKP", EXPORT_KIND_BACKUP},
+      {u"DGR", EXPORT_KIND_TECH_SUPPORT},
+      {u"DGRxyz", EXPORT_KIND_TECH_SUPPORT},
+      {u"dgr", EXPORT_KIND_NONE},
+      {u"VMLx", EXPORT_KIND_NONE},
+      {u"VM", EXPORT_KIND_NONE},
+      {u"bkp", EXPORT_KIND_NONE},
+      {u"", EXPORT_KIND_NONE},
+      {nullptr, EXPORT_KIND_NONE},
+  };
+  for (const Case &C : Cases) {
+    EXPECT_EQ(ClassifyExportSource(C.SourceType), C.Kind) << HostUcs2ToUtf8(C.SourceType);
+  }
+}
+
+TEST_F(ExportTest, RejectedSourceTypeAllocatesNothing) {
+  std::string Out;
+  EXPECT_EQ(Export(u"dgr", nullptr, NWFS_SHARE_TYPE_CIFS, &Out), EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Out, "entering in to ExporttoNWShare()\n\nInvalid: Sourcetype");
+  ExpectNoPoolLeak();
+}
+
+TEST_F(ExportTest, ShareWithoutDriveNameIsNotFound) {
+  Share.Uninstall();
+  fs::create_directories(RamfsDir);
+  std::ofstream(RamfsDir + "/VelmorLog.xml") << "<log/>";
+  std::string Out;
+  EXPECT_EQ(Export(u"VML", nullptr, NWFS_SHARE_TYPE_CIFS, &Out), EFI_NOT_FOUND);
+  EXPECT_NE(Out.find("Drive name not found!\n"), std::string::npos);
+  ExpectNoPoolLeak();
+}
+
+// ---------------------------------------------------------------------------
+// Log and inventories
+// ---------------------------------------------------------------------------
+
+TEST_F(ExportTest, CompressedLogIsTakenWhenThePlainOneIsAbsent) {
+  WriteFile(RamfsDir + "/VelmorLog.xml.gz", "gz");
+  HostSetSmbiosAssetTag(nullptr); // no SMBIOS table at all
+  std::string Out;
+  EXPECT_EQ(Export(u"VML", nullptr, NWFS_SHARE_TYPE_CIFS, &Out), EFI_SUCCESS) << Out;
+  std::vector<std::string> Names = SharedFiles();
+  ASSERT_EQ(Names.size(), 1u);
+  EXPECT_TRUE(std::regex_match(Names[0], std::regex(R"(NoAssetTag_VelmorLog_D.*_T.*\.xml\.gz)")))
+      << Names[0];
+  EXPECT_NE(Out.find("DestPath CIFS:\\ \n"), std::string::npos);
+  ExpectNoPoolLeak();
+}
+
+TEST_F(ExportTest, MissingLogIsNotFoundAndNothingIsWritten) {
+  std::string Out;
+  EXPECT_EQ(Export(u"VML", nullptr, NWFS_SHARE_TYPE_CIFS, &Out), EFI_NOT_FOUND);
+  EXPECT_NE(Out.find("VelmorLog file not found in ramfs!"), std::string::npos);
+  EXPECT_TRUE(SharedFiles().empty());
+  ExpectNoPoolLeak();
+}
+
+// ---------------------------------------------------------------------------
+// Backup image and technical-support report
+// ---------------------------------------------------------------------------
+
+TEST_F(ExportTest, BackupImageOnNfsGoesToTheRootWhateverTheName) {
+  Share.Uninstall();
+  Console([&] { Share.Install(u"share", u"NFS"); });
+  PoolAtStart = HostPoolOutstanding();
+  WriteFile(RamfsDir + "/backup.img", "image bytes");
+  WriteFile(RamfsDir + "/sysInfo.xml", kSysInfo);
+  std::string Out;
+  EXPECT_EQ(Export(u"BKP", u"ignored", NWFS_SHARE_TYPE_NFS, &Out), EFI_SUCCESS) << Out;
+  EXPECT_EQ(SharedFiles(), std::vector<std::string>{"7XK4Q2R_Backup_D2024-02-29_T23-05-09.img"});
+  EXPECT_EQ(ReadFile(ShareDir + "/7XK4Q2R_Backup_D2024-02-29_T23-05-09.img"), "image bytes");
+  EXPECT_NE(Out.find("DestPath NFS:\\ \n"), std::string::npos);
+  ExpectNoPoolLeak();
+}
+
+TEST_F(ExportTest, BackupImageWithUnusableSysInfoIsNotExported) {
+  WriteFile(RamfsDir + "/backup.img", "image bytes");
+  const char *Broken[] = {
+      "<ServiceTag>7XK 4Q2R</ServiceTag><TimeStamp>2024-02-29T23:05:09</TimeStamp>",
+      "<ServiceTag>7XK4Q2R</ServiceTag><TimeStamp>2023-02-29T23:05:09</TimeStamp>",
+      "<ServiceTag>7XK4Q2R</ServiceTag>",
+      "",
+  };
+  for (const char *Text : Broken) {
+    SCOPED_TRACE(Text);
+    WriteFile(RamfsDir + "/sysInfo.xml", Text);
+    std::string Out;
+    EXPECT_TRUE(EFI_ERROR(Export(u"BKP", nullptr, NWFS_SHARE_TYPE_CIFS, &Out)));
+    EXPECT_NE(Out.find("Reading the service tag and time stamp failed!"), std::string::npos);
+    EXPECT_TRUE(SharedFiles().empty());
+    ExpectNoPoolLeak();
+  }
+}
+
+TEST_F(ExportTest, TechnicalSupportReportExportsEveryFileUnderItsName) {
+  fs::create_directories(ShareDir + "/case42");
+  WriteFile(RamfsDir + "/TSReport/b-hw.txt", "hardware");
+  WriteFile(RamfsDir + "/TSReport/a-sys.log", "system");
+  WriteFile(RamfsDir + "/TSReport/bad name.txt", "left out");
+  fs::create_directories(RamfsDir + "/TSReport/sub");
+  std::string Out;
+  EXPECT_EQ(Export(u"DGRxyz", u"case42", NWFS_SHARE_TYPE_CIFS, &Out), EFI_SUCCESS) << Out;
+  EXPECT_EQ(SharedFiles("case42"), (std::vector<std::string>{"a-sys.log", "b-hw.txt"}));
+  EXPECT_EQ(ReadFile(ShareDir + "/case42/b-hw.txt"), "hardware");
+  // In name order, each with the log redirected into ramfs:.
+  size_t First = Out.find("command = [cp -q ramfs:\\TSReport\\a-sys.log CIFS:\\case42\\ > "
+                          "ramfs:\\DGRLog.txt]");
+  size_t Second = Out.find("command = [cp -q ramfs:\\TSReport\\b-hw.txt CIFS:\\case42\\ > "
+                           "ramfs:\\DGRLog.txt]");
+  EXPECT_NE(First, std::string::npos) << Out;
+  EXPECT_NE(Second, std::string::npos);
+  EXPECT_LT(First, Second);
+  EXPECT_NE(Out.find("Report file bad name.txt has an unusable name, left out"), std::string::npos);
+  EXPECT_TRUE(fs::exists(RamfsDir + "/DGRLog.txt"));
+  ExpectNoPoolLeak();
+}
+
+TEST_F(ExportTest, TechnicalSupportWithoutReportIsNotFound) {
+  std::string Out;
+  EXPECT_EQ(Export(u"DGR", nullptr, NWFS_SHARE_TYPE_CIFS, &Out), EFI_NOT_FOUND);
+  fs::create_directories(RamfsDir + "/TSReport");
+  EXPECT_EQ(Export(u"DGR", nullptr, NWFS_SHARE_TYPE_CIFS, &Out), EFI_NOT_FOUND);
+  EXPECT_NE(Out.find("Technical support report not found in ramfs:\\TSReport!"), std::string::npos);
+  ExpectNoPoolLeak();
+}
+
+TEST_F(ExportTest, ExportNameIsFormattedAndBounded) {
+  EFI_TIME Time = {};
+  Time.Year = 2026;
+  Time.Month = 1;
+  Time.Day = 2;
+  Time.Hour = 3;
+  Time.Minute = 4;
+  Time.Second = 5;
+  CHAR16 Name[EXPORT_NAME_CHARS];
+  ASSERT_EQ(BuildExportFileName("TAG", "Word", Time, ".ext", Name, EXPORT_NAME_CHARS), EFI_SUCCESS);
+  EXPECT_EQ(HostUcs2ToUtf8(Name), "TAG_Word_D2026-01-02_T03-04-05.ext");
+  // One character short of the terminator's room.
+  EXPECT_EQ(BuildExportFileName("TAG", "Word", Time, ".ext", Name, 34), EFI_BUFFER_TOO_SMALL);
+  EXPECT_EQ(BuildExportFileName("TAG", "Word", Time, ".ext", Name, 35), EFI_SUCCESS);
+}
+
+// ---------------------------------------------------------------------------
+// SMBIOS asset tag
+// ---------------------------------------------------------------------------
+
+// A structure: type, formatted length, the formatted bytes after the header,
+// then the strings and the closing NUL.
+std::vector<UINT8> Structure(UINT8 Type, std::vector<UINT8> Formatted,
+                             std::vector<std::string> Strings) {
+  std::vector<UINT8> Out = {Type, static_cast<UINT8>(4 + Formatted.size()), 0x00, 0x01};
+  Out.insert(Out.end(), Formatted.begin(), Formatted.end());
+  for (const std::string &S : Strings) {
+    Out.insert(Out.end(), S.begin(), S.end());
+    Out.push_back(0);
+  }
+  if (Strings.empty()) {
+    Out.push_back(0);
+  }
+  Out.push_back(0);
+  return Out;
+}
+
+// A chassis record whose asset tag is string AssetString.
+std::vector<UINT8> Chassis(UINT8 AssetString, std::vector<std::string> Strings) {
+  std::vector<UINT8> Formatted(0x15 - 4, 0);
+  Formatted[0] = 1;               // manufacturer
+  Formatted[1] = 0x17;            // rack mount
+  Formatted[8 - 4] = AssetString; // asset tag
+  return Structure(3, Formatted, Strings);
+}
+
+std::vector<UINT8> Join(std::initializer_list<std::vector<UINT8>> Parts) {
+  std::vector<UINT8> Out;
+  for (const auto &P : Parts) {
+    Out.insert(Out.end(), P.begin(), P.end());
+  }
+  return Out;
+}
+
+std::string AssetTagOf(const std::vector<UINT8> &Table, EFI_STATUS *Status, size_t Length = 0) {
+  CHAR8 Tag[EXPORT_TAG_CHARS];
+  *Status = SmbiosFindChassisAssetTag(Table.data(), Length != 0 ? Length : Table.size(), Tag,
+                                      sizeof(Tag));
+  return Tag;
+}
+
+TEST_F(ExportTest, ChassisAssetTagIsFoundBehindOtherStructures) {
+  std::vector<UINT8> Table =
+      Join({Structure(0, {1, 2, 0, 0}, {"Vendor", "1.0"}), Structure(2, {}, {}),
+            Chassis(3, {"Maker", "Serial", "ABC-123 x/y"}), Structure(127, {}, {})});
+  EFI_STATUS Status;
+  EXPECT_EQ(AssetTagOf(Table, &Status), "ABC-123_x_y");
+  EXPECT_EQ(Status, EFI_SUCCESS);
+}
+
+TEST_F(ExportTest, MalformedSmbiosTablesAreRejectedWithinTheirBounds) {
+  EFI_STATUS Status;
+  struct Case {
+    const char *Name;
+    std::vector<UINT8> Table;
+    size_t Length; // 0: the whole table
+    EFI_STATUS Expected;
+  };
+  std::vector<UINT8> Good = Chassis(1, {"TAG1"});
+  std::vector<UINT8> ZeroLength = Good;
+  ZeroLength[1] = 0;
+  std::vector<UINT8> PastEnd = Good;
+  PastEnd[1] = 0xF0;
+  std::vector<UINT8> Unterminated(Good.begin(), Good.end() - 2); // strings run to the end
+  std::vector<UINT8> Short = Structure(3, {1, 2, 3}, {"x"});     // no asset tag field
+  const Case Cases[] = {
+      {"length below the header", ZeroLength, 0, EFI_COMPROMISED_DATA},
+      {"length past the table", PastEnd, 0, EFI_COMPROMISED_DATA},
+      {"strings without their end", Unterminated, 0, EFI_COMPROMISED_DATA},
+      {"table cut inside the header", Good, 3, EFI_NOT_FOUND},
+      {"asset tag string beyond the set", Chassis(4, {"a", "b"}), 0, EFI_NOT_FOUND},
+      {"no asset tag string", Chassis(0, {"a"}), 0, EFI_NOT_FOUND},
+      {"blank asset tag", Chassis(1, {"   "}), 0, EFI_NOT_FOUND},
+      {"short chassis record", Short, 0, EFI_NOT_FOUND},
+      {"end of table first", Join({Structure(127, {}, {}), Good}), 0, EFI_NOT_FOUND},
+      {"no chassis record", Structure(1, {1, 2, 3, 4}, {"sys"}), 0, EFI_NOT_FOUND},
+  };
+  for (const Case &C : Cases) {
+    // A copy of exactly the bytes given, so that any read past them is seen.
+    std::vector<UINT8> Exact(C.Table.begin(),
+                             C.Table.begin() + (C.Length != 0 ? C.Length : C.Table.size()));
+    AssetTagOf(Exact, &Status);
+    EXPECT_EQ(Status, C.Expected) << C.Name;
+  }
+}
+
+TEST_F(ExportTest, EntryPointsAreCheckedBeforeTheirTableIsUsed) {
+  // The hosted platform serves valid 2.x and 3.x entry points: both lead to
+  // the tag set for the machine.
+  HostSetSmbiosAssetTag("HOST-TAG");
+  const void *Entry2 = nullptr;
+  const void *Entry3 = nullptr;
+  for (UINTN I = 0; I < gST->NumberOfTableEntries; I++) {
+    if (EfiGuidEqual(gST->ConfigurationTable[I].VendorGuid, gEfiSmbiosTableGuid)) {
+      Entry2 = gST->ConfigurationTable[I].VendorTable;
+    }
+    if (EfiGuidEqual(gST->ConfigurationTable[I].VendorGuid, gEfiSmbios3TableGuid)) {
+      Entry3 = gST->ConfigurationTable[I].VendorTable;
+    }
+  }
+  ASSERT_NE(Entry2, nullptr);
+  ASSERT_NE(Entry3, nullptr);
+  CHAR8 Tag[EXPORT_TAG_CHARS];
+  EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Entry2, false, Tag, sizeof(Tag)), EFI_SUCCESS);
+  EXPECT_STREQ(Tag, "HOST-TAG");
+  EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Entry3, true, Tag, sizeof(Tag)), EFI_SUCCESS);
+  EXPECT_STREQ(Tag, "HOST-TAG");
+  EXPECT_EQ(GetSmbiosAssetTag(Tag, sizeof(Tag)), EFI_SUCCESS);
+  EXPECT_STREQ(Tag, "HOST-TAG");
+
+  // Copies bent one way at a time: wrong anchor, wrong length, checksum.
+  std::vector<UINT8> Copy3(static_cast<const UINT8 *>(Entry3),
+                           static_cast<const UINT8 *>(Entry3) + 0x18);
+  std::vector<UINT8> Copy2(static_cast<const UINT8 *>(Entry2),
+                           static_cast<const UINT8 *>(Entry2) + 0x1F);
+  auto Bent = [](std::vector<UINT8> Bytes, size_t At, UINT8 Value) {
+    Bytes[At] = Value;
+    return Bytes;
+  };
+  std::string Ignored = Console([&] {
+    EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Copy3.data(), true, Tag, sizeof(Tag)), EFI_SUCCESS);
+    EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Bent(Copy3, 3, 'X').data(), true, Tag, sizeof(Tag)),
+              EFI_COMPROMISED_DATA);
+    EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Bent(Copy3, 6, 0x20).data(), true, Tag, sizeof(Tag)),
+              EFI_COMPROMISED_DATA);
+    EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Bent(Copy3, 0x0C, 0xFF).data(), true, Tag, sizeof(Tag)),
+              EFI_COMPROMISED_DATA);
+    EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Copy2.data(), false, Tag, sizeof(Tag)), EFI_SUCCESS);
+    EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Bent(Copy2, 0x12, 'X').data(), false, Tag, sizeof(Tag)),
+              EFI_COMPROMISED_DATA);
+    EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Bent(Copy2, 0x16, 0x00).data(), false, Tag, sizeof(Tag)),
+              EFI_COMPROMISED_DATA);
+    // A 3.x entry point whose table is absurdly large is not walked.
+    std::vector<UINT8> Huge = Copy3;
+    UINT32 Size = 0x40000000;
+    memcpy(&Huge[0x0C], &Size, sizeof(Size));
+    UINT8 Sum = 0;
+    Huge[5] = 0;
+    for (UINT8 B : Huge) {
+      Sum = static_cast<UINT8>(Sum + B);
+    }
+    Huge[5] = static_cast<UINT8>(0x100 - Sum);
+    EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Huge.data(), true, Tag, sizeof(Tag)),
+              EFI_COMPROMISED_DATA);
+  });
+}
+
+// ---------------------------------------------------------------------------
+// sysInfo.xml
+// ---------------------------------------------------------------------------
+
+EFI_STATUS ReadElement(const std::string &Text, const char *Element, std::string *Value,
+                       size_t Size = 32) {
+  std::vector<CHAR8> Buffer(Size);
+  EFI_STATUS Status = EFI_SUCCESS;
+  // The text is handed over in a buffer of exactly its length.
+  std::vector<CHAR8> Exact(Text.begin(), Text.end());
+  HostConsoleCaptureBegin();
+  Status = XmlReadElement(Exact.data(), Exact.size(), Element, Buffer.data(), Size);
+  HostConsoleCaptureEnd();
+  *Value = Buffer.data();
+  return Status;
+}
+
+TEST_F(ExportTest, ElementReaderAcceptsOnlyTheOnePlainElement) {
+  struct Case {
+    std::string Text;
+    EFI_STATUS Status;
+    const char *Value;
+  };
+  const Case Cases[] = {
+      {"<a><Tag>V1</Tag></a>", EFI_SUCCESS, "V1"},
+      {"<TagX>no</TagX><Tag>yes</Tag>", EFI_SUCCESS, "yes"},
+      {"<Tag>with space</Tag>", EFI_SUCCESS, "with space"},
+      {"<Tags>no</Tags>", EFI_NOT_FOUND, ""},
+      {"", EFI_NOT_FOUND, ""},
+      {"<Tag>a</Tag><Tag>b</Tag>", EFI_INVALID_PARAMETER, ""},
+      {"<Tag id=\"1\">a</Tag>", EFI_INVALID_PARAMETER, ""},
+      {"<Tag/>", EFI_INVALID_PARAMETER, ""},
+      {"<Tag></Tag>", EFI_INVALID_PARAMETER, ""},
+      {"<Tag>a<b/></Tag>", EFI_INVALID_PARAMETER, ""},
+      {"<Tag>a&amp;b</Tag>", EFI_INVALID_PARAMETER, ""},
+      {"<Tag>a\nb</Tag>", EFI_INVALID_PARAMETER, ""},
+      {"<Tag>a</Ta", EFI_INVALID_PARAMETER, ""},
+      {"<Tag>a</TagX>", EFI_INVALID_PARAMETER, ""},
+      {"<Tag>abc", EFI_INVALID_PARAMETER, ""},
+      {"<Tag", EFI_NOT_FOUND, ""},
+      {std::string("<Tag>a\0b</Tag>", 14), EFI_INVALID_PARAMETER, ""},
+      {"<Tag>" + std::string(31, 'x') + "</Tag>", EFI_SUCCESS, nullptr},
+      {"<Tag>" + std::string(32, 'x') + "</Tag>", EFI_BUFFER_TOO_SMALL, ""},
+  };
+  for (const Case &C : Cases) {
+    std::string Value;
+    EXPECT_EQ(ReadElement(C.Text, "Tag", &Value), C.Status) << C.Text;
+    EXPECT_EQ(Value, C.Value != nullptr ? C.Value : std::string(31, 'x')) << C.Text;
+  }
+}
+
+TEST_F(ExportTest, TimeStampsMustBeRealTimes) {
+  EFI_TIME Time = {};
+  ASSERT_EQ(ParseXmlTimeStamp("2024-02-29T23:59:59", &Time), EFI_SUCCESS);
+  EXPECT_EQ(Time.Year, 2024);
+  EXPECT_EQ(Time.Month, 2);
+  EXPECT_EQ(Time.Day, 29);
+  EXPECT_EQ(Time.Hour, 23);
+  EXPECT_EQ(Time.Minute, 59);
+  EXPECT_EQ(Time.Second, 59);
+  EXPECT_EQ(ParseXmlTimeStamp("2000-02-29T00:00:00", &Time), EFI_SUCCESS);
+  for (const char *Bad :
+       {"1900-02-29T00:00:00", "2023-02-29T00:00:00", "2024-04-31T00:00:00", "2024-13-01T00:00:00",
+        "2024-00-10T00:00:00", "2024-01-01T24:00:00", "2024-01-01T00:60:00", "2024-01-01T00:00:60",
+        "2024-01-01 00:00:00", "2024-1-01T00:00:00", "2024-01-01T00:00:0", "2024-01-01T00:00:000",
+        "+024-01-01T00:00:00", "1899-12-31T00:00:00"}) {
+    EXPECT_EQ(ParseXmlTimeStamp(Bad, &Time), EFI_INVALID_PARAMETER) << Bad;
+  }
+}
+
+TEST_F(ExportTest, SysInfoGivesServiceTagAndTimeStamp) {
+  CHAR8 Tag[EXPORT_TAG_CHARS];
+  EFI_TIME Time = {};
+  WriteFile(RamfsDir + "/sysInfo.xml", kSysInfo);
+  ASSERT_EQ(ReadSysInfo(Tag, sizeof(Tag), &Time), EFI_SUCCESS);
+  EXPECT_STREQ(Tag, "7XK4Q2R");
+  EXPECT_EQ(Time.Year, 2024);
+  EXPECT_EQ(Time.Second, 9);
+  // Too large to be believed.
+  WriteFile(RamfsDir + "/sysInfo.xml", std::string(SYSINFO_MAX_BYTES + 1, ' ') + kSysInfo);
+  Console([&] { EXPECT_EQ(ReadSysInfo(Tag, sizeof(Tag), &Time), EFI_INVALID_PARAMETER); });
+  fs::remove(RamfsDir + "/sysInfo.xml");
+  Console([&] { EXPECT_EQ(ReadSysInfo(Tag, sizeof(Tag), &Time), EFI_NOT_FOUND); });
+  ExpectNoPoolLeak();
+}
+
+} // namespace
