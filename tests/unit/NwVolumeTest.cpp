@@ -1,0 +1,741 @@
+// The network volume's own logic, without a server: the counted list, path
+// splitting and name folding, full paths, the walk over cached listings, the
+// directory-read sequence, the information queries and the lifetime of the
+// shared records under every order of open, close and delete. Listings are
+// seeded into the records directly, so nothing here reaches the network
+// except calls that are acknowledged locally.
+#include "HostImageFixture.h"
+#include "volume/NwVolume.h"
+
+#include <string>
+#include <vector>
+
+namespace {
+
+struct Item {
+  NW_LIST_LINK Link;
+  int Value;
+};
+
+// Fields of the packed records are compared by value: a reference to one
+// may be misaligned.
+template <typename T>
+T Val(T Value) {
+  return Value;
+}
+
+std::vector<int> Values(const NW_LIST_HEAD &Head) {
+  std::vector<int> Out;
+  for (NW_LIST_LINK *Link = Head.First; Link != nullptr; Link = Link->Next) {
+    Out.push_back(NW_LIST_OWNER(Link, Item, Link)->Value);
+  }
+  return Out;
+}
+
+TEST(NwListTest, AppendsAtTheTailAndUnlinksFromAnyPlace) {
+  NW_LIST_HEAD Head;
+  NwListInit(&Head);
+  Item Items[4] = {{{}, 1}, {{}, 2}, {{}, 3}, {{}, 4}};
+  for (Item &I : Items) {
+    NwListAppend(&Head, &I.Link);
+  }
+  EXPECT_EQ(Head.Count, 4u);
+  EXPECT_EQ(Values(Head), (std::vector<int>{1, 2, 3, 4}));
+  EXPECT_TRUE(NwListRemove(&Head, &Items[1].Link)); // middle
+  EXPECT_TRUE(NwListRemove(&Head, &Items[0].Link)); // first
+  EXPECT_TRUE(NwListRemove(&Head, &Items[3].Link)); // last
+  EXPECT_EQ(Values(Head), (std::vector<int>{3}));
+  EXPECT_EQ(Head.First, &Items[2].Link);
+  EXPECT_EQ(Head.Last, &Items[2].Link);
+  EXPECT_EQ(Items[2].Link.Prev, nullptr);
+  EXPECT_EQ(Items[2].Link.Next, nullptr);
+  NwListAppend(&Head, &Items[0].Link);
+  EXPECT_EQ(Values(Head), (std::vector<int>{3, 1}));
+  EXPECT_EQ(Items[0].Link.Prev, &Items[2].Link);
+}
+
+TEST(NwListTest, RefusesToUnlinkWhatIsNotOnTheList) {
+  NW_LIST_HEAD A, B;
+  NwListInit(&A);
+  NwListInit(&B);
+  Item One = {{}, 1}, Two = {{}, 2};
+  NwListAppend(&A, &One.Link);
+  NwListAppend(&B, &Two.Link);
+  EXPECT_FALSE(NwListRemove(&A, &Two.Link));
+  EXPECT_TRUE(NwListRemove(&A, &One.Link));
+  EXPECT_FALSE(NwListRemove(&A, &One.Link)); // twice
+  EXPECT_EQ(A.Count, 0u);
+  EXPECT_EQ(A.First, nullptr);
+  EXPECT_EQ(B.Count, 1u);
+  EXPECT_TRUE(NwListIsEmpty(&A));
+}
+
+std::u16string Component(const std::u16string &Path, EFI_STATUS *Status, std::u16string *Rest) {
+  CHAR16 Buffer[NW_MAX_REMAINING_PATH + 1] = {};
+  const CHAR16 *Cursor = Path.c_str();
+  *Status = GetNextCompName(&Cursor, Buffer);
+  *Rest = Cursor;
+  return Buffer;
+}
+
+TEST(NwPathTest, SplitsOneComponentAtATime) {
+  EFI_STATUS Status;
+  std::u16string Rest;
+  EXPECT_EQ(Component(u"dir\\sub\\file", &Status, &Rest), u"dir");
+  EXPECT_EQ(Status, EFI_SUCCESS);
+  EXPECT_EQ(Rest, u"sub\\file");
+  EXPECT_EQ(Component(u"file.txt", &Status, &Rest), u"file.txt");
+  EXPECT_EQ(Rest, u"");
+  // An empty component between two separators.
+  EXPECT_EQ(Component(u"\\x", &Status, &Rest), u"");
+  EXPECT_EQ(Rest, u"x");
+  // A trailing backslash is refused, and the cursor stays.
+  Component(u"dir\\", &Status, &Rest);
+  EXPECT_EQ(Status, EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Rest, u"dir\\");
+}
+
+TEST(NwPathTest, RemainingPathIsLimitedTo260Characters) {
+  EFI_STATUS Status;
+  std::u16string Rest;
+  std::u16string Longest(NW_MAX_REMAINING_PATH, u'a');
+  EXPECT_EQ(Component(Longest, &Status, &Rest), Longest);
+  EXPECT_EQ(Status, EFI_SUCCESS);
+  Component(Longest + u"a", &Status, &Rest);
+  EXPECT_EQ(Status, EFI_INVALID_PARAMETER);
+}
+
+TEST(NwPathTest, NamesFoldOnlyAsciiLetters) {
+  EXPECT_TRUE(NwNamesEqual(u"Catalog.XML", u"cATALOG.xml"));
+  EXPECT_FALSE(NwNamesEqual(u"caf\u00e9", u"CAF\u00c9")); // no folding beyond ASCII
+  EXPECT_FALSE(NwNamesEqual(u"abc", u"abcd"));
+  EXPECT_FALSE(NwNamesEqual(u"abcd", u"abc"));
+  EXPECT_TRUE(NwNamesEqual(u"", u""));
+  EXPECT_FALSE(NwNamesEqual(u"[", u"{")); // neighbours of the letter ranges
+}
+
+// ---------------------------------------------------------------------------
+// A volume installed on the image handle, with a root record and handle made
+// the way OpenVolume makes them (OpenVolume itself asks the share for its
+// statistics).
+// ---------------------------------------------------------------------------
+struct SeedEntry {
+  std::u16string Name;
+  UINT64 Attribute;
+  UINT64 Size;
+};
+
+class NwVolumeTest : public HostImageTest {
+protected:
+  void SetUp() override {
+    HostImageTest::SetUp();
+    gDriverDebugLevel = 0;
+    gTotalByteRead = 0;
+    gDirReadIndex = 0;
+    gDirRewind = 0;
+    gDirFirstReadDone = 0;
+    ZeroMem(&Share, sizeof(Share));
+    Share.sharename = const_cast<CHAR16 *>(u"cifsshare");
+    Share.shareType = NW_SHARE_TYPE_CIFS;
+    Quiet([&] {
+      ASSERT_EQ(DetectInstallVolume(gImageHandle, "eng", &Share, u"127.0.0.1", u"user", u"pw"),
+                EFI_SUCCESS);
+    });
+    void *Interface = nullptr;
+    ASSERT_EQ(gBS->HandleProtocol(gImageHandle, &gEfiSimpleFileSystemProtocolGuid, &Interface),
+              EFI_SUCCESS);
+    Volume = static_cast<NW_VOLUME *>(Interface);
+    ASSERT_EQ(CreateRootRecord(Volume, &Root), EFI_SUCCESS);
+    Volume->Root = Root;
+    NwListAppend(&Volume->OpenFiles, &Root->VolumeLink);
+    RootHandle = NewHandle(Root);
+  }
+
+  void TearDown() override {
+    if (Volume != nullptr) {
+      ASSERT_EQ(RemoveInstalledVolume(Volume), EFI_SUCCESS);
+    }
+    EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
+    HostImageTest::TearDown();
+  }
+
+  static void Quiet(const std::function<void()> &Body) { Console(Body); }
+
+  NW_FILE_HANDLE *NewHandle(NW_OPEN_FILE *Record, UINT64 Mode = 3) {
+    NW_FILE_HANDLE *Handle = nullptr;
+    EXPECT_EQ(CreateFileHandleInstance(Record, &Handle, Mode), EFI_SUCCESS);
+    return Handle;
+  }
+
+  void Seed(NW_OPEN_FILE *Directory, const std::vector<SeedEntry> &Entries) {
+    for (const SeedEntry &E : Entries) {
+      NW_DIRECTORY_ENTRY Entry = {};
+      Entry.Attribute = E.Attribute;
+      Entry.FileSize = E.Size;
+      Entry.PhysicalSize = E.Size;
+      ASSERT_EQ(AddToDirList(Directory, &Entry, E.Name.c_str()), EFI_SUCCESS);
+    }
+  }
+
+  // A child record of Directory, made from a seeded entry of that name.
+  NW_OPEN_FILE *Child(NW_OPEN_FILE *Directory, const std::u16string &Name) {
+    NW_DIR_ENTRY *Entry = nullptr;
+    EXPECT_TRUE(FindMatchingDirEntry(Directory, Name.c_str(), &Entry));
+    NW_OPEN_FILE *Record = nullptr;
+    EXPECT_EQ(CreateFHFromDirEntryList(Entry, Directory, &Record), EFI_SUCCESS);
+    return Record;
+  }
+
+  EFI_FILE_PROTOCOL *P(NW_FILE_HANDLE *Handle) { return &Handle->Protocol; }
+
+  EFI_STATUS Open(NW_FILE_HANDLE *From, const std::u16string &Path, EFI_FILE_PROTOCOL **Out,
+                  UINT64 Mode = 1, UINT64 Attributes = 0) {
+    EFI_STATUS Status = EFI_SUCCESS;
+    Quiet([&] { Status = P(From)->Open(P(From), Out, Path.c_str(), Mode, Attributes); });
+    return Status;
+  }
+
+  std::u16string PathOf(NW_OPEN_FILE *Record) {
+    CHAR16 *Path = nullptr;
+    EFI_STATUS Status = EFI_SUCCESS;
+    Quiet([&] { Status = FindCurrentLocation(Record, &Path); });
+    if (EFI_ERROR(Status)) {
+      return u"<error>";
+    }
+    std::u16string Out = Path;
+    fsFreeMemory(Volume, Path);
+    return Out;
+  }
+
+  // One directory Read: the name delivered, "" at the end of the listing.
+  std::u16string ReadName(NW_FILE_HANDLE *Handle, EFI_STATUS *Status = nullptr) {
+    std::vector<UINT8> Buffer(512);
+    UINTN Size = Buffer.size();
+    EFI_STATUS Result = EFI_SUCCESS;
+    Quiet([&] { Result = P(Handle)->Read(P(Handle), &Size, Buffer.data()); });
+    if (Status != nullptr) {
+      *Status = Result;
+    }
+    if (EFI_ERROR(Result) || Size == 0) {
+      return u"";
+    }
+    return reinterpret_cast<EFI_FILE_INFO *>(Buffer.data())->FileName;
+  }
+
+  NW_SHARE_INFO Share;
+  NW_VOLUME *Volume = nullptr;
+  NW_OPEN_FILE *Root = nullptr;
+  NW_FILE_HANDLE *RootHandle = nullptr;
+};
+
+TEST_F(NwVolumeTest, FullPathsAreRelativeToTheShareRoot) {
+  Seed(Root, {{u"Dir", EFI_FILE_DIRECTORY, 0}});
+  NW_OPEN_FILE *Dir = Child(Root, u"Dir");
+  Seed(Dir, {{u".", EFI_FILE_DIRECTORY, 0}, {u"..", EFI_FILE_DIRECTORY, 0}, {u"f.txt", 0x20, 5}});
+  EXPECT_EQ(PathOf(Root), u"");
+  EXPECT_EQ(PathOf(Dir), u"Dir");
+  EXPECT_EQ(PathOf(Child(Dir, u"f.txt")), u"Dir\\f.txt");
+  // "." stands for the directory itself, ".." for its parent.
+  EXPECT_EQ(PathOf(Child(Dir, u".")), u"Dir");
+  EXPECT_EQ(PathOf(Child(Dir, u"..")), u"");
+  Share.shareType = NW_SHARE_TYPE_NFS;
+  EXPECT_EQ(PathOf(Child(Dir, u"f.txt")), u"Dir/f.txt");
+}
+
+TEST_F(NwVolumeTest, FullPathLongerThan512CharactersIsRefused) {
+  std::u16string Long(300, u'x');
+  Seed(Root, {{Long, EFI_FILE_DIRECTORY, 0}});
+  NW_OPEN_FILE *A = Child(Root, Long);
+  // The limit counts the path as "\a\b": 512 characters with the separator in
+  // front, which the share's relative form leaves out.
+  Seed(A, {{Long.substr(0, 210), EFI_FILE_DIRECTORY, 0}, {Long.substr(0, 211), 0, 0}});
+  EXPECT_EQ(PathOf(Child(A, Long.substr(0, 210))).size(), 511u);
+  CHAR16 *Path = nullptr;
+  EFI_STATUS Status = EFI_SUCCESS;
+  std::string Text =
+      Console([&] { Status = FindCurrentLocation(Child(A, Long.substr(0, 211)), &Path); });
+  EXPECT_EQ(Status, EFI_BUFFER_TOO_SMALL);
+  EXPECT_NE(Text.find("Error!: File path length 513 is more than 512\n"), std::string::npos);
+}
+
+TEST_F(NwVolumeTest, WalkFollowsDotsCaseAndOpenRecords) {
+  Seed(Root, {{u"Tools", EFI_FILE_DIRECTORY, 0}, {u"Other", EFI_FILE_DIRECTORY, 0}});
+  NW_OPEN_FILE *Tools = Child(Root, u"Tools");
+  Seed(Tools, {{u"Sub", EFI_FILE_DIRECTORY, 0}});
+  NW_OPEN_FILE *Sub = Child(Tools, u"Sub");
+  NW_OPEN_FILE *Other = Child(Root, u"Other");
+  // Handles held on the records keep them open whatever the closes below
+  // do to the cached listings, so every step is found among open records.
+  NW_FILE_HANDLE *Held[] = {NewHandle(Tools), NewHandle(Sub), NewHandle(Other)};
+
+  struct Case {
+    std::u16string Path;
+    NW_OPEN_FILE *Expected;
+  } Cases[] = {
+      {u"\\tools\\SUB", Sub},
+      {u"Tools\\.\\Sub", Sub},
+      {u"Other\\..\\Tools\\Sub", Sub},
+      {u"..\\..\\Tools", Tools},
+      {u"Tools\\Sub\\", Sub},
+      {u"\\", Root},
+      {u".", Root},
+      {u"\\Tools\\Sub\\..", Tools},
+  };
+  for (const Case &C : Cases) {
+    EFI_FILE_PROTOCOL *Out = nullptr;
+    ASSERT_EQ(Open(RootHandle, C.Path, &Out), EFI_SUCCESS)
+        << std::string(C.Path.begin(), C.Path.end());
+    EXPECT_EQ(NwHandleOf(Out)->OpenFile, C.Expected);
+    EXPECT_EQ(Out->Close(Out), EFI_SUCCESS);
+  }
+  // Relative to a handle on a subdirectory.
+  EFI_FILE_PROTOCOL *Out = nullptr;
+  ASSERT_EQ(Open(Held[0], u"sub", &Out), EFI_SUCCESS);
+  EXPECT_EQ(std::u16string(NwHandleOf(Out)->FullPath), u"Tools\\Sub");
+  Out->Close(Out);
+  for (NW_FILE_HANDLE *H : Held) {
+    P(H)->Close(P(H));
+  }
+}
+
+TEST_F(NwVolumeTest, OpenRefusalsKeepTheirStatuses) {
+  Seed(Root, {{u"Dir", EFI_FILE_DIRECTORY, 0}, {u"X", EFI_FILE_DIRECTORY, 0}, {u"f.txt", 0x20, 3}});
+  NW_OPEN_FILE *F = Child(Root, u"f.txt");
+  NW_FILE_HANDLE *FileHandle = NewHandle(F);
+  EFI_FILE_PROTOCOL *Out = nullptr;
+  EXPECT_EQ(Open(RootHandle, u"Dir", &Out, 2), EFI_INVALID_PARAMETER); // write without read
+  EXPECT_EQ(Open(RootHandle, u"Dir", &Out, EFI_FILE_MODE_CREATE | 1), EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Open(RootHandle, u"Dir", &Out, 1, 0x40), EFI_NOT_FOUND); // bad attributes
+  EXPECT_EQ(Open(RootHandle, u"missing", &Out), EFI_NOT_FOUND);
+  EXPECT_EQ(Open(RootHandle, u"missing\\deeper", &Out, EFI_FILE_MODE_CREATE | 3), EFI_NOT_FOUND);
+  EXPECT_EQ(Open(RootHandle, u"X\\", &Out), EFI_NOT_FOUND); // too short to lose its backslash
+  EXPECT_EQ(Open(RootHandle, std::u16string(261, u'a'), &Out), EFI_NOT_FOUND);
+  EXPECT_EQ(Open(FileHandle, u"anything", &Out), EFI_NOT_FOUND); // a file is no directory
+  EXPECT_EQ(Open(RootHandle, u"Dir\\\\x", &Out, EFI_FILE_MODE_CREATE | 3), EFI_NOT_FOUND);
+  EFI_STATUS Status = EFI_SUCCESS;
+  Quiet([&] { Status = P(RootHandle)->Open(P(RootHandle), &Out, nullptr, 1, 0); });
+  EXPECT_EQ(Status, EFI_NOT_FOUND);
+  Volume->ReadOnly = 1;
+  EXPECT_EQ(Open(RootHandle, u"Dir", &Out, 3), EFI_WRITE_PROTECTED);
+  EXPECT_EQ(Open(RootHandle, u"Dir", &Out, 1), EFI_SUCCESS);
+  Out->Close(Out);
+  P(FileHandle)->Close(P(FileHandle));
+}
+
+TEST_F(NwVolumeTest, CreatingADirectoryStaysLocalAndListsDotEntries) {
+  Seed(Root, {{u"a.txt", 0x20, 1}});
+  EFI_FILE_PROTOCOL *Dir = nullptr;
+  ASSERT_EQ(Open(RootHandle, u"NewDir", &Dir, EFI_FILE_MODE_CREATE | 3, EFI_FILE_DIRECTORY),
+            EFI_SUCCESS);
+  NW_OPEN_FILE *Record = NwHandleOf(Dir)->OpenFile;
+  EXPECT_TRUE(NwIsDirectory(Record));
+  EXPECT_EQ(Val(Record->DirEntries.Count), 2u);
+  EXPECT_EQ(ReadName(NwHandleOf(Dir)), u".");
+  NW_DIR_ENTRY *Entry = nullptr;
+  EXPECT_TRUE(FindMatchingDirEntry(Root, u"newdir", &Entry)); // now in the parent's listing
+  EXPECT_EQ(Val(Record->Children.Count), 0u); // the "." and ".." records are not kept
+  Dir->Close(Dir);
+}
+
+TEST_F(NwVolumeTest, DirectoryOfNEntriesTakesNPlusOneReadsWithData) {
+  Seed(Root, {{u"a", 0x20, 1}, {u"b", 0x20, 2}, {u"c", 0x20, 3}});
+  std::vector<std::u16string> Got;
+  for (int I = 0; I < 5; I++) {
+    Got.push_back(ReadName(RootHandle));
+  }
+  EXPECT_EQ(Got, (std::vector<std::u16string>{u"a", u"a", u"b", u"c", u""}));
+  // The next listing starts over, again with n + 1 reads.
+  for (int I = 0; I < 5; I++) {
+    Got[I] = ReadName(RootHandle);
+  }
+  EXPECT_EQ(Got, (std::vector<std::u16string>{u"a", u"a", u"b", u"c", u""}));
+}
+
+TEST_F(NwVolumeTest, SingleEntryIsDeliveredTwiceThenNothing) {
+  Seed(Root, {{u"only", 0x20, 7}});
+  EXPECT_EQ(ReadName(RootHandle), u"only");
+  EXPECT_EQ(ReadName(RootHandle), u"only");
+  EFI_STATUS Status = EFI_DEVICE_ERROR;
+  EXPECT_EQ(ReadName(RootHandle, &Status), u"");
+  EXPECT_EQ(Status, EFI_SUCCESS);
+  EXPECT_EQ(ReadName(RootHandle), u"only");
+}
+
+TEST_F(NwVolumeTest, TooSmallBufferAnswersTheSizeAndKeepsTheEntry) {
+  Seed(Root, {{u"first.bin", 0x20, 9}, {u"second", 0x20, 1}});
+  UINTN Size = 0;
+  EFI_STATUS Status = EFI_SUCCESS;
+  Quiet([&] { Status = P(RootHandle)->Read(P(RootHandle), &Size, nullptr); });
+  EXPECT_EQ(Status, EFI_BUFFER_TOO_SMALL);
+  EXPECT_EQ(Size, 84u + 2 * 9);
+  UINT64 RecordsBefore = Volume->OpenFiles.Count;
+  std::vector<UINT8> Buffer(Size);
+  Quiet([&] { Status = P(RootHandle)->Read(P(RootHandle), &Size, Buffer.data()); });
+  ASSERT_EQ(Status, EFI_SUCCESS);
+  auto *Info = reinterpret_cast<EFI_FILE_INFO *>(Buffer.data());
+  EXPECT_EQ(std::u16string(Info->FileName), u"first.bin");
+  EXPECT_EQ(Info->Size, 84u + 2 * 9);
+  EXPECT_EQ(Info->FileSize, 9u);
+  EXPECT_EQ(Info->PhysicalSize, 9u);
+  EXPECT_EQ(Val(Volume->OpenFiles.Count), RecordsBefore); // the temporary record went again
+}
+
+TEST_F(NwVolumeTest, DirectoryPositionRewindsOneEntryAndIsProcessWide) {
+  Seed(Root, {{u"a", 0x20, 1}, {u"b", 0x20, 1}, {u"c", 0x20, 1}});
+  UINT64 Position = 0;
+  EXPECT_EQ(P(RootHandle)->GetPosition(P(RootHandle), &Position), EFI_UNSUPPORTED);
+  Quiet([&] { EXPECT_EQ(P(RootHandle)->SetPosition(P(RootHandle), 5), EFI_UNSUPPORTED); });
+  EXPECT_EQ(ReadName(RootHandle), u"a");
+  EXPECT_EQ(ReadName(RootHandle), u"a"); // index now 1
+  EXPECT_EQ(ReadName(RootHandle), u"b"); // index now 2
+  Quiet([&] { EXPECT_EQ(P(RootHandle)->SetPosition(P(RootHandle), 0), EFI_SUCCESS); });
+  EXPECT_EQ(ReadName(RootHandle), u"b"); // back by one, not to the start
+  EXPECT_EQ(Val(RootHandle->Position), 0u);
+  // A second handle on another directory continues the same index.
+  NW_OPEN_FILE *Dir = nullptr;
+  Seed(Root, {{u"D", EFI_FILE_DIRECTORY, 0}});
+  Dir = Child(Root, u"D");
+  Seed(Dir, {{u"d0", 0x20, 1}, {u"d1", 0x20, 1}, {u"d2", 0x20, 1}, {u"d3", 0x20, 1}});
+  NW_FILE_HANDLE *Other = NewHandle(Dir);
+  EXPECT_EQ(ReadName(Other), u"d2");
+  EXPECT_EQ(ReadName(RootHandle), u"D");
+  P(Other)->Close(P(Other));
+}
+
+TEST_F(NwVolumeTest, UnreadableListingFailsTheReadAndTheOpen) {
+  // No listing is cached and the share is not connected.
+  EFI_STATUS Status = EFI_SUCCESS;
+  UINTN Size = 200;
+  std::vector<UINT8> Buffer(Size);
+  Quiet([&] { Status = P(RootHandle)->Read(P(RootHandle), &Size, Buffer.data()); });
+  EXPECT_TRUE(EFI_ERROR(Status));
+  EFI_FILE_PROTOCOL *Out = nullptr;
+  EXPECT_TRUE(EFI_ERROR(Open(RootHandle, u"anything", &Out)));
+  EXPECT_EQ(Val(Root->DirEntries.Count), 0u);
+}
+
+// ---------------------------------------------------------------------------
+// Information
+// ---------------------------------------------------------------------------
+TEST_F(NwVolumeTest, LabelAndSystemInfoReportTheirSizes) {
+  EFI_FILE_PROTOCOL *H = P(RootHandle);
+  UINTN Size = 0;
+  EXPECT_EQ(H->GetInfo(H, &gEfiFileSystemVolumeLabelInfoIdGuid, &Size, nullptr),
+            EFI_BUFFER_TOO_SMALL);
+  EXPECT_EQ(Size, 10u);
+  CHAR16 Label[8] = {};
+  Size = sizeof(Label);
+  EXPECT_EQ(H->GetInfo(H, &gEfiFileSystemVolumeLabelInfoIdGuid, &Size, Label), EFI_SUCCESS);
+  EXPECT_EQ(std::u16string(Label), u"CIFS");
+  EXPECT_EQ(Size, 10u);
+
+  Volume->TotalSize = 4096000;
+  Volume->FreeSpace = 1000;
+  Volume->BlockSize = 4096;
+  Size = 0;
+  Quiet([&] {
+    EXPECT_EQ(H->GetInfo(H, &gEfiFileSystemInfoGuid, &Size, nullptr), EFI_BUFFER_TOO_SMALL);
+  });
+  EXPECT_EQ(Size, 46u);
+  std::vector<UINT8> Buffer(Size);
+  EXPECT_EQ(H->GetInfo(H, &gEfiFileSystemInfoGuid, &Size, Buffer.data()), EFI_SUCCESS);
+  auto *Info = reinterpret_cast<EFI_FILE_SYSTEM_INFO *>(Buffer.data());
+  EXPECT_EQ(Info->Size, 46u);
+  EXPECT_EQ(Info->VolumeSize, 4096000u);
+  EXPECT_EQ(Info->BlockSize, 4096u);
+  EXPECT_EQ(std::u16string(Info->VolumeLabel), u"CIFS");
+  EXPECT_EQ(Size, 46u);
+
+  const EFI_GUID Unknown = {1, 2, 3, {4, 5, 6, 7, 8, 9, 10, 11}};
+  EXPECT_EQ(H->GetInfo(H, &Unknown, &Size, Buffer.data()), EFI_UNSUPPORTED);
+  EXPECT_EQ(H->SetInfo(H, &Unknown, Size, Buffer.data()), EFI_UNSUPPORTED);
+}
+
+TEST_F(NwVolumeTest, LabelFromAListingEntryCountsCharactersNotBytes) {
+  Volume->Valid = 0;
+  ZeroMem(Volume->VolumeID, sizeof(Volume->VolumeID));
+  Seed(Root,
+       {{u"dir", EFI_FILE_DIRECTORY | EFI_FILE_RESERVED, 0}, {u"MY.LABEL", EFI_FILE_RESERVED, 0}});
+  CHAR16 Label[16] = {};
+  UINTN Size = 4;
+  EXPECT_EQ(GetVolumeLabel(Volume, &Size, Label), EFI_BUFFER_TOO_SMALL);
+  EXPECT_EQ(Size, 16u);                                    // 2 x 7 + 2
+  EXPECT_EQ(std::u16string(Volume->VolumeID), u"MYLABEL"); // adopted on the way
+  Volume->Valid = 0;
+  Size = sizeof(Label);
+  EXPECT_EQ(GetVolumeLabel(Volume, &Size, Label), EFI_SUCCESS);
+  EXPECT_EQ(std::u16string(Label), u"MYLABEL");
+  EXPECT_EQ(Size, 7u);
+}
+
+TEST_F(NwVolumeTest, LabelWithoutIdentifierOrEntryIsEmpty) {
+  Volume->Valid = 0;
+  Seed(Root, {{u"plain", 0x20, 0}});
+  CHAR16 Label[4] = {u'x', u'x', u'x', 0};
+  UINTN Size = sizeof(Label);
+  EXPECT_EQ(GetVolumeLabel(Volume, &Size, Label), EFI_SUCCESS);
+  EXPECT_EQ(Size, 2u);
+  EXPECT_EQ(Label[0], 0);
+  Size = 1;
+  EXPECT_EQ(GetVolumeLabel(Volume, &Size, Label), EFI_BUFFER_TOO_SMALL);
+  EXPECT_EQ(Size, 2u);
+}
+
+TEST_F(NwVolumeTest, FileInfoFallsBackToCachedValuesWhenTheStatFails) {
+  Seed(Root, {{u"data.bin", 0x21, 12345}});
+  NW_OPEN_FILE *F = Child(Root, u"data.bin");
+  UINTN Size = 0;
+  EXPECT_EQ(GetFileInfoFromFH(F, &Size, nullptr), EFI_BUFFER_TOO_SMALL);
+  EXPECT_EQ(Size, 84u + 2 * 8);
+  std::vector<UINT8> Buffer(Size);
+  EFI_STATUS Status = EFI_DEVICE_ERROR;
+  Quiet([&] { Status = GetFileInfoFromFH(F, &Size, Buffer.data()); });
+  EXPECT_EQ(Status, EFI_SUCCESS);
+  auto *Info = reinterpret_cast<EFI_FILE_INFO *>(Buffer.data());
+  EXPECT_EQ(Info->FileSize, 12345u);
+  EXPECT_EQ(Info->Attribute, 0x21u);
+  EXPECT_EQ(std::u16string(Info->FileName), u"data.bin");
+  ReleaseOpenFile(F);
+}
+
+TEST_F(NwVolumeTest, SetInfoGuardsTheRootAndTheBufferSizes) {
+  EFI_FILE_PROTOCOL *H = P(RootHandle);
+  std::vector<UINT8> Buffer(120);
+  auto *Info = reinterpret_cast<EFI_FILE_INFO *>(Buffer.data());
+  Info->Size = Buffer.size();
+  Info->Attribute = EFI_FILE_DIRECTORY;
+  EXPECT_EQ(H->SetInfo(H, &gEfiFileInfoGuid, Buffer.size(), Info), EFI_ACCESS_DENIED);
+  EXPECT_EQ(H->SetInfo(H, &gEfiFileInfoGuid, 79, Info), EFI_BAD_BUFFER_SIZE);
+  EXPECT_EQ(H->SetInfo(H, &gEfiFileSystemInfoGuid, 37, Info), EFI_BAD_BUFFER_SIZE);
+  CHAR16 NewLabel[] = u"SHARE2";
+  EXPECT_EQ(H->SetInfo(H, &gEfiFileSystemVolumeLabelInfoIdGuid, sizeof(NewLabel), NewLabel),
+            EFI_SUCCESS);
+  EXPECT_EQ(std::u16string(Volume->VolumeID), u"SHARE2");
+  CHAR16 TooLong[] = u"ABCDEFGHIJKLMNOP";
+  EXPECT_EQ(H->SetInfo(H, &gEfiFileSystemVolumeLabelInfoIdGuid, sizeof(TooLong), TooLong),
+            EFI_INVALID_PARAMETER);
+  Volume->ReadOnly = 1;
+  EXPECT_EQ(H->SetInfo(H, &gEfiFileSystemVolumeLabelInfoIdGuid, sizeof(NewLabel), NewLabel),
+            EFI_WRITE_PROTECTED);
+}
+
+// ---------------------------------------------------------------------------
+// Record lifetime
+// ---------------------------------------------------------------------------
+TEST_F(NwVolumeTest, RecordInUseIsNeverFreed) {
+  Seed(Root, {{u"D", EFI_FILE_DIRECTORY, 0}, {u"L", EFI_FILE_DIRECTORY, 0}});
+  NW_OPEN_FILE *D = Child(Root, u"D");
+  EXPECT_EQ(ReleaseOpenFile(Root), EFI_ACCESS_DENIED);
+  NW_FILE_HANDLE *H = NewHandle(D);
+  EXPECT_EQ(ReleaseOpenFile(D), EFI_ACCESS_DENIED); // held by a handle
+  EXPECT_EQ(Val(D->HandleCount), 1);
+  Seed(D, {{u"x", 0x20, 1}});
+  NW_OPEN_FILE *X = Child(D, u"x");
+  EXPECT_EQ(P(H)->Close(P(H)), EFI_SUCCESS);
+  EXPECT_EQ(Val(D->DirEntries.Count), 0u);          // the close dropped D's listing...
+  EXPECT_EQ(ReleaseOpenFile(D), EFI_ACCESS_DENIED); // ...but D still has a child
+  EXPECT_EQ(Val(D->Children.Count), 1u);
+  UINT64 Records = Volume->OpenFiles.Count;
+  EXPECT_EQ(ReleaseOpenFile(X), EFI_SUCCESS); // X, and D that only stayed for it
+  EXPECT_EQ(Val(Volume->OpenFiles.Count), Records - 2);
+  // A record held only by its cached listing.
+  Seed(Root, {{u"L", EFI_FILE_DIRECTORY, 0}});
+  NW_OPEN_FILE *L = Child(Root, u"L");
+  Seed(L, {{u"y", 0x20, 1}});
+  EXPECT_EQ(ReleaseOpenFile(L), EFI_ACCESS_DENIED);
+  DiscardDirEntries(L);
+  EXPECT_EQ(ReleaseOpenFile(L), EFI_SUCCESS);
+  EXPECT_EQ(Val(Root->Children.Count), 0u);
+}
+
+TEST_F(NwVolumeTest, DeleteThroughOneHandleInvalidatesTheOthers) {
+  Seed(Root, {{u"D", EFI_FILE_DIRECTORY, 0}});
+  EFI_FILE_PROTOCOL *A = nullptr, *B = nullptr, *C = nullptr;
+  ASSERT_EQ(Open(RootHandle, u"D", &A), EFI_SUCCESS);
+  ASSERT_EQ(Open(RootHandle, u"D", &B), EFI_SUCCESS);
+  ASSERT_EQ(Open(RootHandle, u"d", &C), EFI_SUCCESS);
+  NW_OPEN_FILE *D = NwHandleOf(A)->OpenFile;
+  EXPECT_EQ(NwHandleOf(B)->OpenFile, D);
+  EXPECT_EQ(Val(D->HandleCount), 3);
+  EFI_STATUS Status = EFI_DEVICE_ERROR;
+  Quiet([&] { Status = B->Delete(B); });
+  EXPECT_EQ(Status, EFI_SUCCESS);
+  UINTN Size = 100;
+  UINT8 Buffer[100];
+  UINT64 Position = 0;
+  EFI_FILE_PROTOCOL *Out = nullptr;
+  for (EFI_FILE_PROTOCOL *H : {A, C}) {
+    Quiet([&] {
+      EXPECT_EQ(H->Read(H, &Size, Buffer), EFI_NOT_FOUND);
+      EXPECT_EQ(H->GetInfo(H, &gEfiFileInfoGuid, &Size, Buffer), EFI_NOT_FOUND);
+      EXPECT_EQ(H->SetPosition(H, 0), EFI_NOT_FOUND);
+      EXPECT_EQ(H->GetPosition(H, &Position), EFI_NOT_FOUND);
+      EXPECT_EQ(H->Flush(H), EFI_NOT_FOUND);
+      EXPECT_EQ(H->Open(H, &Out, u".", 1, 0), EFI_NOT_FOUND);
+      EXPECT_EQ(H->Delete(H), EFI_NOT_FOUND);
+    });
+  }
+  EXPECT_EQ(A->Close(A), EFI_SUCCESS);
+  EXPECT_EQ(C->Close(C), EFI_SUCCESS);
+  EXPECT_EQ(Val(Volume->FileHandles.Count), 1u);
+  EXPECT_EQ(Val(Root->Children.Count), 0u);
+}
+
+// A directory deleted while a handle on one of its children is open: the
+// directory's record stays for the child, and every order of closing the
+// rest frees everything exactly once.
+TEST_F(NwVolumeTest, DeletingADirectoryUnderAnOpenChild) {
+  const int Orders[][2] = {{0, 1}, {1, 0}};
+  for (const auto &Order : Orders) {
+    DiscardDirEntries(Root);
+    Seed(Root, {{u"D", EFI_FILE_DIRECTORY, 0}});
+    EFI_FILE_PROTOCOL *Dir = nullptr, *Other = nullptr, *Inner = nullptr;
+    ASSERT_EQ(Open(RootHandle, u"D", &Dir, 3), EFI_SUCCESS);
+    NW_OPEN_FILE *D = NwHandleOf(Dir)->OpenFile;
+    Seed(D, {{u"E", EFI_FILE_DIRECTORY, 0}});
+    ASSERT_EQ(Open(NwHandleOf(Dir), u"E", &Inner), EFI_SUCCESS);
+    ASSERT_EQ(Open(RootHandle, u"D", &Other), EFI_SUCCESS);
+    DiscardDirEntries(D); // D's listing is not cached: deletable
+    EFI_STATUS Status = EFI_DEVICE_ERROR;
+    Quiet([&] { Status = Dir->Delete(Dir); });
+    EXPECT_EQ(Status, EFI_SUCCESS);
+    EXPECT_EQ(Val(NwHandleOf(Other)->OpenFile), nullptr);
+    EXPECT_EQ(Val(D->HandleCount), 0); // kept alive by its child only
+    EXPECT_EQ(Val(NwHandleOf(Inner)->OpenFile->Parent), D);
+    EFI_FILE_PROTOCOL *Left[] = {Other, Inner};
+    for (int I : Order) {
+      Quiet([&] { EXPECT_EQ(Left[I]->Close(Left[I]), EFI_SUCCESS); });
+    }
+    EXPECT_EQ(Val(Volume->OpenFiles.Count), 1u);
+    EXPECT_EQ(Val(Volume->FileHandles.Count), 1u);
+  }
+}
+
+// A rename moves the handle to a record of the new name; the old record
+// goes, nothing is asked of the share.
+TEST_F(NwVolumeTest, RenamingADirectoryMovesTheHandle) {
+  Seed(Root, {{u"Old", EFI_FILE_DIRECTORY, 0}});
+  EFI_FILE_PROTOCOL *Dir = nullptr;
+  ASSERT_EQ(Open(RootHandle, u"Old", &Dir, 3), EFI_SUCCESS);
+  NW_OPEN_FILE *Old = NwHandleOf(Dir)->OpenFile;
+  std::u16string NewName = u"Renamed";
+  std::vector<UINT8> Info(SIZE_OF_EFI_FILE_INFO + 2 * (NewName.size() + 1));
+  auto *Request = reinterpret_cast<EFI_FILE_INFO *>(Info.data());
+  Request->Size = Info.size();
+  Request->Attribute = EFI_FILE_DIRECTORY;
+  std::copy(NewName.begin(), NewName.end(),
+            reinterpret_cast<CHAR16 *>(Info.data() + SIZE_OF_EFI_FILE_INFO));
+  EFI_STATUS Status = EFI_DEVICE_ERROR;
+  Quiet([&] { Status = Dir->SetInfo(Dir, &gEfiFileInfoGuid, Info.size(), Info.data()); });
+  ASSERT_EQ(Status, EFI_SUCCESS);
+  NW_OPEN_FILE *New = NwHandleOf(Dir)->OpenFile;
+  EXPECT_NE(New, Old);
+  EXPECT_EQ(std::u16string(New->FileName), NewName);
+  EXPECT_EQ(std::u16string(NwHandleOf(Dir)->FullPath), NewName);
+  EXPECT_EQ(Val(New->HandleCount), 1);
+  EXPECT_EQ(Val(New->DirectoryEntry.Attribute), EFI_FILE_DIRECTORY | EFI_FILE_ARCHIVE);
+  EXPECT_EQ(Val(Root->Children.Count), 1u); // the old record is gone
+  EXPECT_EQ(Val(Volume->FileHandles.Count), 2u);
+  // The size of a directory cannot change.
+  Request->FileSize = 10;
+  Quiet([&] { Status = Dir->SetInfo(Dir, &gEfiFileInfoGuid, Info.size(), Info.data()); });
+  EXPECT_EQ(Status, EFI_ACCESS_DENIED);
+  Dir->Close(Dir);
+}
+
+TEST_F(NwVolumeTest, DeleteRefusalsCloseTheHandle) {
+  Seed(Root, {{u"Full", EFI_FILE_DIRECTORY, 0},
+              {u"Empty", EFI_FILE_DIRECTORY, 0},
+              {u"Locked", EFI_FILE_DIRECTORY | EFI_FILE_READ_ONLY | EFI_FILE_ARCHIVE, 0}});
+  NW_OPEN_FILE *Full = Child(Root, u"Full");
+  Seed(Full, {{u".", 0x10, 0}, {u"..", 0x10, 0}, {u"x", 0x20, 1}});
+  NW_OPEN_FILE *Empty = Child(Root, u"Empty");
+  Seed(Empty, {{u".", 0x10, 0}, {u"..", 0x10, 0}});
+  UINT64 Handles = Volume->FileHandles.Count;
+  struct Case {
+    NW_OPEN_FILE *Record;
+    EFI_STATUS Expected;
+  } Cases[] = {{Full, EFI_WARN_DELETE_FAILURE}, // first: any close drops other listings
+               {Root, EFI_WARN_DELETE_FAILURE},
+               {Child(Root, u"Locked"), EFI_WARN_DELETE_FAILURE},
+               {Empty, EFI_SUCCESS}};
+  for (const Case &C : Cases) {
+    NW_FILE_HANDLE *H = NewHandle(C.Record);
+    EFI_STATUS Status = EFI_DEVICE_ERROR;
+    Quiet([&] { Status = P(H)->Delete(P(H)); });
+    EXPECT_EQ(Status, C.Expected);
+    EXPECT_EQ(Val(Volume->FileHandles.Count), Handles); // closed either way
+  }
+}
+
+TEST_F(NwVolumeTest, ClosesInEveryOrderLeaveNothingBehind) {
+  Seed(Root, {{u"D", EFI_FILE_DIRECTORY, 0}});
+  UINT64 BytesAtStart = Volume->AllocatedBytes;
+  const int Orders[][3] = {{0, 1, 2}, {2, 1, 0}, {1, 0, 2}, {1, 2, 0}};
+  for (const auto &Order : Orders) {
+    EFI_FILE_PROTOCOL *H[3] = {};
+    NW_OPEN_FILE *D = Child(Root, u"D");
+    Seed(D, {{u"E", EFI_FILE_DIRECTORY, 0}});
+    ASSERT_EQ(Open(RootHandle, u"D", &H[0]), EFI_SUCCESS);
+    ASSERT_EQ(Open(RootHandle, u"D\\E", &H[1]), EFI_SUCCESS);
+    ASSERT_EQ(Open(NwHandleOf(H[0]), u"E", &H[2]), EFI_SUCCESS);
+    for (int I : Order) {
+      Quiet([&] { H[I]->Close(H[I]); });
+    }
+    // D may have gone with its last child; what is left goes now.
+    NW_OPEN_FILE *Left = nullptr;
+    if (!EFI_ERROR(FindMatchingFH(Volume, u"D", Root, &Left))) {
+      DiscardDirEntries(Left);
+      EXPECT_EQ(ReleaseOpenFile(Left), EFI_SUCCESS);
+    }
+    DiscardDirEntries(Root);
+    Seed(Root, {{u"D", EFI_FILE_DIRECTORY, 0}});
+    EXPECT_EQ(Val(Volume->FileHandles.Count), 1u);
+    EXPECT_EQ(Val(Volume->OpenFiles.Count), 1u);
+    EXPECT_EQ(Val(Volume->AllocatedBytes), BytesAtStart);
+  }
+}
+
+TEST_F(NwVolumeTest, CloseKeepsOnlyTheListingOfTheClosedEntrysParent) {
+  Seed(Root, {{u"A", EFI_FILE_DIRECTORY, 0}, {u"B", EFI_FILE_DIRECTORY, 0}});
+  NW_OPEN_FILE *A = Child(Root, u"A");
+  NW_OPEN_FILE *B = Child(Root, u"B");
+  Seed(A, {{u"a1", EFI_FILE_DIRECTORY, 0}});
+  Seed(B, {{u"b1", EFI_FILE_DIRECTORY, 0}});
+  NW_FILE_HANDLE *HandleOnA1 = NewHandle(Child(A, u"a1"));
+  NW_FILE_HANDLE *HandleOnB = NewHandle(B);
+  UINT64 Cached = Volume->CachedEntryCount;
+  P(HandleOnA1)->Close(P(HandleOnA1));
+  EXPECT_EQ(Val(A->DirEntries.Count), 1u);
+  EXPECT_EQ(Val(B->DirEntries.Count), 0u);
+  EXPECT_EQ(Val(Root->DirEntries.Count), 0u);
+  EXPECT_EQ(Val(Volume->CachedEntryCount), Cached - 3);
+  P(HandleOnB)->Close(P(HandleOnB));
+}
+
+TEST_F(NwVolumeTest, HandleAllocationFailureLeavesTheRecordAsItWas) {
+  UINT64 Bytes = Volume->AllocatedBytes;
+  HostPoolFailAfter(0);
+  NW_FILE_HANDLE *H = nullptr;
+  std::string Text =
+      Console([&] { EXPECT_EQ(CreateFileHandleInstance(Root, &H, 3), EFI_OUT_OF_RESOURCES); });
+  HostPoolFailAfter(UINT64_MAX);
+  EXPECT_NE(Text.find("CreateFileHandleInstance: Memory allocation failed!\n"), std::string::npos);
+  EXPECT_EQ(Val(Root->HandleCount), 1);
+  EXPECT_EQ(Val(Volume->FileHandles.Count), 1u);
+  EXPECT_EQ(Val(Volume->AllocatedBytes), Bytes);
+}
+
+TEST_F(NwVolumeTest, RemovingTheVolumeFreesHandlesStillOpen) {
+  Seed(Root, {{u"D", EFI_FILE_DIRECTORY, 0}});
+  EFI_FILE_PROTOCOL *Left = nullptr;
+  ASSERT_EQ(Open(RootHandle, u"D", &Left), EFI_SUCCESS);
+  ASSERT_EQ(RemoveInstalledVolume(Volume), EFI_SUCCESS);
+  Volume = nullptr;
+  void *Interface = nullptr;
+  EXPECT_EQ(gBS->HandleProtocol(gImageHandle, &gEfiSimpleFileSystemProtocolGuid, &Interface),
+            EFI_UNSUPPORTED);
+  // TearDown checks that the pool is back where it started.
+}
+
+} // namespace
