@@ -209,3 +209,64 @@ fw_verify_status() {
     want && /^ *0+: / { print toupper($2); exit }
   ' <<<"$1"
 }
+
+# fw_var_hex TEXT GUID NAME: the data of the variable GUID:NAME in dmpstore's
+# output, as one lower-case hex string; empty when the variable is not there.
+fw_var_hex() {
+  awk -v want="$(tr '[:lower:]' '[:upper:]' <<<"$2:$3")" '
+    /^Variable / { on = index(toupper($0), want) > 0; next }
+    on && /^ *[0-9A-F]+: / {
+      line = $0
+      sub(/^ *[0-9A-F]+: /, "", line)
+      sub(/  \*.*$/, "", line)
+      gsub(/[- ]/, "", line)
+      printf "%s", tolower(line)
+      next
+    }
+    { on = 0 }
+  ' <<<"$1"
+}
+
+# fw_hex_text HEX: the text held by the hex bytes, up to the first NUL.
+fw_hex_text() {
+  local hex=$1 out="" i pair
+  for ((i = 0; i + 1 < ${#hex}; i += 2)); do
+    pair=${hex:i:2}
+    [ "$pair" = 00 ] && break
+    out+=$(printf "\\x$pair")
+  done
+  printf '%s' "$out"
+}
+
+# fw_stamp_markers LOG OUT: in the background, follows the serial log LOG
+# (which must not exist yet: fw_boot creates it) and writes each "@@" line it
+# sees to OUT, prefixed with this machine's time in seconds. Its process id
+# is left in FW_STAMPER_PID and added to FW_CLEANUP_PIDS.
+fw_stamp_markers() {
+  perl -MTime::HiRes=time,sleep -e '
+    my ($log, $out) = @ARGV;
+    open(my $o, ">", $out) or die "$out: $!";
+    $o->autoflush(1);
+    my $in;
+    sleep 0.05 until open($in, "<", $log);
+    my $pending = "";
+    while (1) {
+      my $n = sysread($in, my $chunk, 65536);
+      if (!$n) { sleep 0.05; next; }
+      $pending .= $chunk;
+      while ($pending =~ s/^([^\n]*)\n//) {
+        my $line = $1;
+        $line =~ s/\e\[[0-9;?=]*[A-Za-z]//g;
+        $line =~ s/[\r\s]+$//;
+        printf $o "%.2f %s\n", time, $line if $line =~ /^@@/;
+      }
+    }
+  ' "$1" "$2" &
+  FW_STAMPER_PID=$!
+  FW_CLEANUP_PIDS+=("$FW_STAMPER_PID")
+}
+
+# fw_marker_time STAMPS LINE: the time at which LINE was first seen.
+fw_marker_time() {
+  awk -v want="$2" '{ t = $1; $1 = ""; sub(/^ /, "") } $0 == want { print t; exit }' "$1"
+}

@@ -174,16 +174,6 @@ UINT32 SMB2ReadResponseStart(INT32 SockFd, SMB2_HEADER *Header, void *Body, UINT
                              bool ReadFixedBody, const CHAR8 *Function, UINT32 Line) {
   UINT32 Nt = STATUS_UNSUCCESSFUL;
   EFI_STATUS Status = SMB2ReadVerifyHeader(Header, &TransactDetails, SockFd, &Nt);
-  // A server that takes its time first sends an interim answer with
-  // STATUS_PENDING; the header check refuses and consumes it, and the final
-  // answer follows on the same message id.
-  for (UINT32 Interim = 0;
-       EFI_ERROR(Status) && Status != EFI_PROTOCOL_ERROR &&
-       TransactDetails.ResponseStatus == STATUS_PENDING && Interim < SMB2_MAX_INTERIM_RESPONSES;
-       Interim++) {
-    Smb2Log(DIAG_VERBOSE, "Interim response, waiting for the final one\n");
-    Status = SMB2ReadVerifyHeader(Header, &TransactDetails, SockFd, &Nt);
-  }
   if (EFI_ERROR(Status)) {
     DiagError("SMB2ReadVerifyHeader failed!", Status, Function, Line);
     return Nt != SMB2_NT_SUCCESS ? Nt : STATUS_UNSUCCESSFUL;

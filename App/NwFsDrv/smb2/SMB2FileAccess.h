@@ -490,10 +490,6 @@ constexpr UINT16 SMB2_QUERY_DIRECTORY_NAME_OFFSET = 96; // from the SMB2 header
 // Extra zeroed bytes behind a stored directory answer.
 constexpr UINT32 SMB2_DIR_INFO_SLACK = 72;
 
-// Interim answers (STATUS_PENDING) skipped before a final answer.
-constexpr UINT32 STATUS_PENDING = 0x00000103;
-constexpr UINT32 SMB2_MAX_INTERIM_RESPONSES = 16;
-
 constexpr UINT8 SMB2_INFO_FILE = 1;
 constexpr UINT8 SMB2_INFO_FILESYSTEM = 2;
 constexpr UINT8 FILE_DIRECTORY_INFORMATION = 1;
@@ -563,8 +559,8 @@ UINT32 SMB2SendFileRequest(INT32 SockFd, const SMB2_SEND_PIECE *Pieces, UINT32 C
                            const CHAR8 *What, const CHAR8 *Function = __builtin_FUNCTION(),
                            UINT32 Line = __builtin_LINE());
 
-// Reads and checks the response header into *Header (interim STATUS_PENDING
-// answers are consumed on the way to the final one), then, with
+// Reads and checks the response header into *Header (the header read skips
+// interim answers on the way to the final one), then, with
 // ReadFixedBody, the body's fixed part of BodySize bytes into Body. A message
 // too short for its fixed part is consumed and refused. Returns the NT-style
 // code (0, STATUS_UNSUCCESSFUL, or the transport status of a failed receive).

@@ -245,6 +245,13 @@ UINT32 SMB2DrainRefused(INT32 SockFd, const SMB2_HEADER *Header, UINT32 BodyByte
   return SMB2DrainBytes(SockFd, Body - BodyBytesRead, Details, Drained);
 }
 
+namespace {
+// An interim answer: STATUS_PENDING says only that the final answer follows.
+bool IsInterimResponse(const SMB2_HEADER *Header) {
+  return Header->Status == STATUS_PENDING;
+}
+} // namespace
+
 EFI_STATUS SMB2ReadVerifyHeader(SMB2_HEADER *Header, TRANSACT_DETAILS *Details, INT32 SockFd,
                                 UINT32 *NtStatus) {
   UINT32 LocalNt;
@@ -264,6 +271,15 @@ EFI_STATUS SMB2ReadVerifyHeader(SMB2_HEADER *Header, TRANSACT_DETAILS *Details, 
   SMB2_HEADER *Received = reinterpret_cast<SMB2_HEADER *>(Buffer);
   INT64 BytesRead = 0;
   INT32 Rx = SMB2ReceiveAll(SockFd, Buffer, SMB2_FRAMED_HEADER_SIZE, Details, &BytesRead);
+  for (UINT32 Interim = 0;
+       Rx == 0 && IsInterimResponse(Received) && Interim < SMB2_MAX_INTERIM_RESPONSES; Interim++) {
+    Smb2Log(DIAG_VERBOSE, "Interim response, waiting for the final one\n");
+    if (SMB2DrainBytes(SockFd, SMB2BodyLength(Received), Details) != SMB2_NT_SUCCESS) {
+      Rx = -1;
+      break;
+    }
+    Rx = SMB2ReceiveAll(SockFd, Buffer, SMB2_FRAMED_HEADER_SIZE, Details, &BytesRead);
+  }
   *NtStatus = static_cast<UINT32>(Rx);
   EFI_STATUS Status;
   if (Rx != 0) {

@@ -21,6 +21,7 @@ constexpr UINT32 STATUS_UNSUCCESSFUL = 0xC0000001;
 constexpr UINT32 STATUS_INVALID_INFO_CLASS = 0xC0000004;
 constexpr UINT32 STATUS_END_OF_FILE = 0xC0000011;
 constexpr UINT32 STATUS_MORE_PROCESSING_REQUIRED = 0xC0000016;
+constexpr UINT32 STATUS_PENDING = 0x00000103;
 constexpr UINT32 STATUS_NO_MEMORY = 0xC0000017;
 constexpr UINT32 STATUS_LOGON_FAILURE = 0xC000006D;
 constexpr UINT32 STATUS_BAD_NETWORK_NAME = 0xC00000CC;
@@ -69,6 +70,10 @@ constexpr UINT16 SMB2_QUERY_INFO_STRUCTURE_SIZE = 41;
 constexpr UINT32 SMB2_STREAM_PREFIX_SIZE = 4;
 constexpr UINT32 SMB2_MAX_STREAM_LENGTH = 0x00FFFFFF;
 constexpr UINT32 SMB2_MAX_BUFFERED_BODY = 0x10000;
+// A server that takes its time with a request first sends interim answers
+// (STATUS_PENDING); the header read quietly skips at most this many before
+// the final answer on the same message id.
+constexpr UINT32 SMB2_MAX_INTERIM_RESPONSES = 16;
 
 // ---------------------------------------------------------------------------
 // Framed header
@@ -249,7 +254,8 @@ UINT32 SMB2SendVerdict(UINT32 Sent);
 // Reading responses
 // ---------------------------------------------------------------------------
 EFI_STATUS SMB2VerifyHeader(const SMB2_HEADER *Header, TRANSACT_DETAILS *Details);
-// Reads exactly the 68 header bytes, checks them and copies them out. A
+// Reads exactly the 68 header bytes (skipping interim answers), checks them
+// and copies them out. A
 // refused header has the rest of its message consumed so that the next
 // exchange starts on a message boundary.
 EFI_STATUS SMB2ReadVerifyHeader(SMB2_HEADER *Header, TRANSACT_DETAILS *Details, INT32 SockFd,
