@@ -233,7 +233,7 @@ fw_hex_text() {
   for ((i = 0; i + 1 < ${#hex}; i += 2)); do
     pair=${hex:i:2}
     [ "$pair" = 00 ] && break
-    out+=$(printf "\\x$pair")
+    out+=$(printf '%b' "\\x$pair")
   done
   printf '%s' "$out"
 }
@@ -268,5 +268,6 @@ fw_stamp_markers() {
 
 # fw_marker_time STAMPS LINE: the time at which LINE was first seen.
 fw_marker_time() {
+  [ -f "$1" ] || return 0
   awk -v want="$2" '{ t = $1; $1 = ""; sub(/^ /, "") } $0 == want { print t; exit }' "$1"
 }
