@@ -1,6 +1,7 @@
 # shellcheck shell=bash
 # Helpers of the firmware tests: disk image, QEMU/OVMF boot, console log
-# clean-up and the checks. Sourced by tests/firmware/run-*.sh.
+# clean-up, the checks, variables in dmpstore's output and the times at which
+# marker lines appear. Sourced by tests/firmware/run-*.sh.
 
 OVMF_CODE=${OVMF_CODE:-/usr/share/OVMF/OVMF_CODE_4M.fd}
 OVMF_VARS=${OVMF_VARS:-/usr/share/OVMF/OVMF_VARS_4M.fd}

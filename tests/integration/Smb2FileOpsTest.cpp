@@ -7,15 +7,14 @@
 // With CIFSDRV_BENCH_FILE set (scripts/bench-read.sh) the disabled
 // ReadThroughput test times reads of that share file through GEE_NWFRead.
 #include "ProvisioningVars.h"
+#include "SambaServer.h"
 #include "Smb2TestEnv.h"
 #include "smb2/SMB2FsAdapter.h"
 #include "volume/NWLib.h"
 
 #include <pwd.h>
-#include <stdio.h>
 #include <sys/stat.h>
 #include <sys/statvfs.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -30,33 +29,9 @@
 
 namespace {
 
-const std::string kUser = "cifstest";
-const std::string kPassword = "Cifs-Test-Pw1";
-const std::string kStateDir = "/tmp/cifsdrv-samba";
+using SambaServer::kPassword;
+using SambaServer::kUser;
 constexpr UINT64 kCreateReadWrite = EFI_FILE_MODE_CREATE | EFI_FILE_MODE_READ | EFI_FILE_MODE_WRITE;
-
-std::string ShareDirFor(const std::string &MaxProto) {
-  std::string Lower = MaxProto;
-  std::transform(Lower.begin(), Lower.end(), Lower.begin(), ::tolower);
-  return kStateDir + "/share-" + Lower;
-}
-
-// Starts (or keeps) the server the session tests use, at a highest protocol.
-int StartSamba(const std::string &MaxProto, std::string *Output) {
-  std::string Root = __FILE__; // <root>/tests/integration/Smb2FileOpsTest.cpp
-  Root = Root.substr(0, Root.rfind("/tests/"));
-  std::string Command = "SMB_STATE_DIR=" + kStateDir +
-                        " SMB_MIN_PROTO=SMB2_02 SMB_MAX_PROTO=" + MaxProto + " SMB_USER=" + kUser +
-                        " SMB_PASS=" + kPassword +
-                        " SMB_SHARE=cifsshare SMB_DIR=" + ShareDirFor(MaxProto) + " bash " + Root +
-                        "/scripts/samba-test-server.sh start 2>&1";
-  FILE *Pipe = popen(Command.c_str(), "r");
-  char Buffer[512];
-  while (Pipe != nullptr && fgets(Buffer, sizeof(Buffer), Pipe) != nullptr) {
-    *Output += Buffer;
-  }
-  return Pipe == nullptr ? -1 : WEXITSTATUS(pclose(Pipe));
-}
 
 std::u16string U16(const std::string &Text) {
   return std::u16string(Text.begin(), Text.end());
@@ -109,13 +84,13 @@ protected:
   // Starts the server and connects; the test works in a directory of its
   // own inside the share.
   void StartAndConnect(const std::string &MaxProto, UINT64 ShareType = NW_SHARE_TYPE_CIFS) {
+    ASSERT_TRUE(SambaServer::Start(MaxProto));
     std::string Out;
-    ASSERT_EQ(StartSamba(MaxProto, &Out), 0) << Out;
     Dialect = MaxProto == "SMB2_02" ? SMB2_DIALECT_202 : SMB2_DIALECT_210;
     WorkName = "fileops-" + std::to_string(getpid()) + "-" +
                ::testing::UnitTest::GetInstance()->current_test_info()->name();
     std::replace(WorkName.begin(), WorkName.end(), '/', '-');
-    Work = ShareDirFor(MaxProto) + "/" + WorkName;
+    Work = SambaServer::ShareDir(MaxProto) + "/" + WorkName;
     MakeHostDir(Work);
     Strings = {u"127.0.0.1", U16(kUser), U16(kPassword), u"cifsshare"};
     auto At = Strings.begin();
@@ -545,7 +520,7 @@ TEST_F(FileOpsSambaTest, DISABLED_ReadThroughput) {
   const char *Name = getenv("CIFSDRV_BENCH_FILE");
   ASSERT_NE(Name, nullptr);
   StartAndConnect("SMB2_10");
-  const UINT64 Size = std::filesystem::file_size(ShareDirFor("SMB2_10") + "/" + Name);
+  const UINT64 Size = std::filesystem::file_size(SambaServer::ShareDir("SMB2_10") + "/" + Name);
   const char *RoundsText = getenv("CIFSDRV_BENCH_ROUNDS");
   const int Rounds = RoundsText != nullptr ? std::max(1, atoi(RoundsText)) : 5;
   std::vector<UINT8> Buffer(1024 * 1024);

@@ -53,20 +53,13 @@ TEST_F(ExportTest, SourceTypesAreClassifiedWholeExceptTheReportPrefix) {
     const CHAR16 *SourceType;
     UINT32 Kind;
   };
-  const Case Cases[] = {
-      {u"VML", EXPORT_KIND_LOG},
-      {u"HWI", EXPORT_KIND_HW_INVENTORY},
-      {u"ASI", EXPORT_KIND_SW_INVENTORY},
-      {u"BKP", EXPORT_KIND_BACKUP},
-      {u"DGR", EXPORT_KIND_TECH_SUPPORT},
-      {u"DGRxyz", EXPORT_KIND_TECH_SUPPORT},
-      {u"dgr", EXPORT_KIND_NONE},
-      {u"VMLx", EXPORT_KIND_NONE},
-      {u"VM", EXPORT_KIND_NONE},
-      {u"bkp", EXPORT_KIND_NONE},
-      {u"", EXPORT_KIND_NONE},
-      {nullptr, EXPORT_KIND_NONE},
-  };
+  const Case Cases[] = {{u"VML", EXPORT_KIND_LOG},          {u"HWI", EXPORT_KIND_HW_INVENTORY},
+                        {u"ASI", EXPORT_KIND_SW_INVENTORY}, {u"BKP", EXPORT_KIND_BACKUP},
+                        {u"DGR", EXPORT_KIND_TECH_SUPPORT}, {u"DGRxyz", EXPORT_KIND_TECH_SUPPORT},
+                        {u"dgr", EXPORT_KIND_NONE},         {u"VMLx", EXPORT_KIND_NONE},
+                        {u"VM", EXPORT_KIND_NONE},          {u"", EXPORT_KIND_NONE},
+                        {nullptr, EXPORT_KIND_NONE}};
+
   for (const Case &C : Cases) {
     EXPECT_EQ(ClassifyExportSource(C.SourceType), C.Kind) << HostUcs2ToUtf8(C.SourceType);
   }

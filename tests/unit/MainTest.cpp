@@ -167,16 +167,6 @@ TEST_F(MainTest, DriverBindingPublishesTheStaticMountProtocolOnce) {
   EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
 }
 
-TEST_F(MainTest, ComponentNameAnswersOnlyInEnglish) {
-  CHAR16 *Name = nullptr;
-  char Eng[] = "eng", EnUs[] = "en-US";
-  ASSERT_EQ(SimpleFileSystemGetDriverName(&gSimpleFileSystemComponentName, Eng, &Name),
-            EFI_SUCCESS);
-  EXPECT_EQ(std::u16string(Name), u"PIOMISKU File System Driver");
-  EXPECT_EQ(SimpleFileSystemGetDriverName(&gSimpleFileSystemComponentName, EnUs, &Name),
-            EFI_UNSUPPORTED);
-}
-
 TEST_F(MainTest, PathTrimmingTakesWhatFollowsTheFirstVolumePrefix) {
   const CHAR16 *Path = u"ramfs:\\dir\\f.img";
   const CHAR16 *Twice = u"a:\\b:\\c";

@@ -284,25 +284,6 @@ TEST_F(Smb2FileWireTest, ContextsGoOutBoundedByTheirMessage) {
   EXPECT_EQ(Plain[71], 0);
 }
 
-TEST_F(Smb2FileWireTest, BatchWithoutLeasingSendsItsDurableContextAsZeros) {
-  ScriptConnect(SMB2_DIALECT_210, 0);
-  Expect([](uint64_t Id) { return CreateAnswer(Id); });
-  ScriptDisconnect();
-  Connect();
-  NW_REMOTE_FILE File;
-  std::u16string Name = u"a.txt";
-  ZeroMem(&File, sizeof(File));
-  File.FileName = Name.data();
-  File.OplockLevel = 9;
-  Console([&] { ASSERT_EQ(GEE_NWFOpen(&Share, &File, EFI_FILE_MODE_READ, 2), EFI_SUCCESS); });
-  std::vector<Bytes> Sent = FileRequests();
-  ASSERT_EQ(Sent.size(), 1u);
-  ASSERT_EQ(Sent[0].size(), 124u + 16 + 40 + 2);
-  EXPECT_EQ(GetLe32(Sent[0], 116), 0u);
-  EXPECT_EQ(GetLe32(Sent[0], 120), 40u);
-  EXPECT_EQ(Bytes(Sent[0].begin() + 140, Sent[0].end()), Bytes(42, 0));
-}
-
 TEST_F(Smb2FileWireTest, ReadWriteCreateAndWrite) {
   ScriptConnect(SMB2_DIALECT_202, 0);
   Expect([](uint64_t Id) { return CreateAnswer(Id); });
@@ -339,36 +320,6 @@ TEST_F(Smb2FileWireTest, ReadWriteCreateAndWrite) {
   EXPECT_EQ(GetLe64(Write, 76), 7u);
   EXPECT_EQ(Bytes(Write.begin() + 84, Write.begin() + 100), Bytes(kFileId, kFileId + 16));
   EXPECT_EQ(std::string(Write.begin() + 116, Write.end()), "hello");
-}
-
-TEST_F(Smb2FileWireTest, VolumeSizesFromTheFileSystemAnswer) {
-  ScriptConnect();
-  Expect([](uint64_t Id) { return CreateAnswer(Id); });
-  Expect([](uint64_t Id) {
-    Bytes Fs;
-    Put(Fs, 8, 1000);
-    Put(Fs, 8, 300);
-    Put(Fs, 4, 8);
-    Put(Fs, 4, 512);
-    return QueryAnswer(16, Id, Fs);
-  });
-  Expect([](uint64_t Id) { return CloseAnswer(Id); });
-  ScriptDisconnect();
-  Connect();
-  EFI_FILE_SYSTEM_INFO Info = {};
-  Info.ReadOnly = TRUE;
-  Console([&] { ASSERT_EQ(GEE_NWGetFSInfo(&Share, &Info), EFI_SUCCESS); });
-  EXPECT_EQ(+Info.VolumeSize, 4096000u);
-  EXPECT_EQ(+Info.FreeSpace, 300u * 4096);
-  EXPECT_EQ(+Info.BlockSize, 4096u);
-  EXPECT_EQ(+Info.ReadOnly, FALSE);
-  std::vector<Bytes> Sent = FileRequests();
-  ASSERT_EQ(Sent.size(), 3u);
-  // The share root (no name) opened for the query and closed again.
-  EXPECT_EQ(GetLe16(Sent[0], 114), 0);
-  EXPECT_EQ(CommandOf(Sent[1]), SMB2_QUERY_INFO);
-  EXPECT_EQ(CommandOf(Sent[2]), SMB2_CLOSE);
-  EXPECT_EQ(+gFileAccessDetails.FileId[0], 0);
 }
 
 } // namespace
