@@ -151,13 +151,19 @@ EFI_SHELL_PROTOCOL *CurrentShell() {
 
 namespace {
 
-// One Execute call (parent image handle, command line, no environment). The
-// return value is the launch status; CommandStatus the command's own.
+// One command: carried out in the image when the shell would run it in a
+// nested instance (whose mappings are not the caller's) and the image knows
+// it, else one Execute call (parent image handle, command line, no
+// environment). The return value is the launch status; CommandStatus the
+// command's own.
 EFI_STATUS ShellExecute(EFI_SHELL_PROTOCOL *Shell, const CHAR16 *CommandLine,
                         EFI_STATUS *CommandStatus) {
   *CommandStatus = EFI_SUCCESS;
   if (Shell == nullptr || Shell->Execute == nullptr) {
     return EFI_NOT_FOUND;
+  }
+  if (ShellNestsCommands(Shell) && ShellRunBuiltin(Shell, CommandLine, CommandStatus)) {
+    return EFI_SUCCESS;
   }
   // Execute takes a writable line; hand it a copy.
   CHAR16 *Line = StrDup(CommandLine);

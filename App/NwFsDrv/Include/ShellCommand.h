@@ -63,6 +63,18 @@ INTN RunShellCommand(const CHAR16 *CommandLine);
 // conversion cannot be allocated.
 INTN RunShellCommandAscii(const CHAR8 *CommandLine);
 
+// True when the shell runs each Execute in a nested shell instance: its
+// "nonesting" variable is present and not "True" (any case). Such a nested
+// instance keeps a mapping table of its own.
+bool ShellNestsCommands(EFI_SHELL_PROTOCOL *Shell);
+// Carries out one of the image's own command lines ("map -u", "map -r",
+// "map NAME TARGET:", "vol NAME:", "cd PATH", "cp [-q] SRC DST [> FILE]",
+// "del [-q] PATH") on the shell's own protocol functions. False when the line
+// is none of these (the caller then hands it to Execute); otherwise true with
+// the command's status in *CommandStatus.
+bool ShellRunBuiltin(EFI_SHELL_PROTOCOL *Shell, const CHAR16 *CommandLine,
+                     EFI_STATUS *CommandStatus);
+
 // Console capture: ConOut and StdErr of the system table are switched to a
 // capturing output until the capture ends. EFI_ALREADY_STARTED when a capture
 // is active, EFI_UNSUPPORTED without a system table.

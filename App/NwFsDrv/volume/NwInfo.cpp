@@ -174,7 +174,14 @@ EFI_STATUS SetFileInfo(NW_FILE_HANDLE *Handle, UINTN BufferSize, const EFI_FILE_
 } // namespace
 
 EFI_STATUS GetFileInfoFromFH(NW_OPEN_FILE *OpenFile, UINTN *BufferSize, void *Buffer) {
-  UINTN Needed = FileInfoSize(OpenFile->FileName);
+  // The root is deliberately reported with an empty name although the record
+  // keeps "\": firmware shells find a volume's root by climbing with ".."
+  // until the name comes back empty, and ".." on the root opens the root
+  // again, so any other name would keep them climbing forever.
+  const bool IsRoot = OpenFile->ROOTDIR != 0 ||
+                      (OpenFile->FileName != nullptr && NwNamesEqual(OpenFile->FileName, u"\\"));
+  const CHAR16 *ReportedName = IsRoot ? u"" : OpenFile->FileName;
+  UINTN Needed = FileInfoSize(ReportedName);
   DiagLog(DIAG_VERBOSE, "Pfh->FileName = %ls\n", OpenFile->FileName);
   if (*BufferSize < Needed) {
     *BufferSize = Needed;
@@ -212,8 +219,8 @@ EFI_STATUS GetFileInfoFromFH(NW_OPEN_FILE *OpenFile, UINTN *BufferSize, void *Bu
   }
   Info->PhysicalSize = Info->FileSize;
   Info->Attribute = Entry.Attribute & EFI_FILE_VALID_ATTR;
-  if (OpenFile->FileName != nullptr) {
-    CopyMem(Info->FileName, OpenFile->FileName, StrLen(OpenFile->FileName) * sizeof(CHAR16));
+  if (ReportedName != nullptr) {
+    CopyMem(Info->FileName, ReportedName, StrLen(ReportedName) * sizeof(CHAR16));
   }
   *BufferSize = Needed;
   Info->Size = Needed;
