@@ -585,6 +585,9 @@ TEST_F(NwVolumeSambaTest, SetInfoRenamesLocallyAndChangesSizesLocally) {
   EFI_STATUS Status;
   std::vector<UINT8> RootInfo = Info(Root, gEfiFileInfoGuid, &Status);
   ASSERT_EQ(Status, EFI_SUCCESS);
+  // Firmware shells find the root by its empty name when they build paths.
+  ASSERT_EQ(RootInfo.size(), 84u);
+  EXPECT_EQ(reinterpret_cast<const EFI_FILE_INFO *>(RootInfo.data())->FileName[0], u'\0');
   Quiet([&] { Status = Root->SetInfo(Root, &gEfiFileInfoGuid, RootInfo.size(), RootInfo.data()); });
   EXPECT_EQ(Status, EFI_ACCESS_DENIED);
 
