@@ -325,6 +325,12 @@ TEST_F(NtlmTest, AuthenticateFailuresLeakNothing) {
             EFI_DEVICE_ERROR);
   HostSetTimeFailure(false);
 
+  // A challenge record shorter than the fixed part (its flags lie at 20..23)
+  // is refused before anything is read from it.
+  SMB2_NTLM_CHALLENGE Short = {ChallengeBytes.data(), 20};
+  EXPECT_EQ(SMB2NTLMAuthenticateBlobConstruct(&Short, &TransactDetails, &Message, &Length),
+            EFI_INVALID_PARAMETER);
+
   TransactDetails.ShareDetails.Password[0] = '\0';
   EXPECT_EQ(SMB2NTLMAuthenticateBlobConstruct(&Challenge, &TransactDetails, &Message, &Length),
             EFI_INVALID_PARAMETER);

@@ -98,8 +98,7 @@ UINT32 SMB2SendRequest(INT32 SockFd, const void *Request, UINT64 Length, UINT32 
   }
   UINT8 *Copy = static_cast<UINT8 *>(AllocateZeroPool(Length + 1));
   if (Copy == nullptr) {
-    Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Memory allocation failed!\n", __func__,
-            __LINE__);
+    SMB2PrintAllocFailure();
     return STATUS_NO_MEMORY;
   }
   CopyMem(Copy, Request, Length);
@@ -311,6 +310,16 @@ EFI_STATUS SMB2ReadVerifyHeader(SMB2_HEADER *Header, TRANSACT_DETAILS *Details, 
   }
   FreePool(Buffer);
   return Status;
+}
+
+void SMB2PrintAllocFailure(const CHAR8 *Function, UINT32 Line) {
+  Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Memory allocation failed!\n", Function, Line);
+}
+
+void SMB2PrintReceiveFailure(UINT32 Status, const CHAR8 *Function, UINT32 Line) {
+  Smb2Log(DIAG_ALWAYS,
+          "Function: %s, Line no.: = %d, TCP_PollAndReceiveMessage failed! Status = 0x%x\n",
+          Function, Line, Status);
 }
 
 EFI_STATUS SMB2MapNtStatus(UINT32 NtStatus, const CHAR8 *Callee, const CHAR8 *Function,

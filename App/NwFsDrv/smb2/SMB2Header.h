@@ -24,7 +24,6 @@ constexpr UINT32 STATUS_MORE_PROCESSING_REQUIRED = 0xC0000016;
 constexpr UINT32 STATUS_PENDING = 0x00000103;
 constexpr UINT32 STATUS_NO_MEMORY = 0xC0000017;
 constexpr UINT32 STATUS_LOGON_FAILURE = 0xC000006D;
-constexpr UINT32 STATUS_BAD_NETWORK_NAME = 0xC00000CC;
 constexpr UINT32 SMB2_NT_INVALID_PARAMETER = 0x80070057;
 constexpr UINT32 SMB2_NT_OUT_OF_MEMORY = 0x8007000E;
 
@@ -279,6 +278,15 @@ UINT32 SMB2DrainRefused(INT32 SockFd, const SMB2_HEADER *Header, UINT32 BodyByte
 // The body bytes that follow a framed header (stream length − 64), or 0 for
 // a stream shorter than a header.
 UINT32 SMB2BodyLength(const SMB2_HEADER *Header);
+
+// The two failure lines every request and response function shares:
+// "Function: %s, Line no.: = %d, Memory allocation failed!\n" and
+// "Function: %s, Line no.: = %d, TCP_PollAndReceiveMessage failed! Status = 0x%x\n",
+// naming the calling function and line.
+void SMB2PrintAllocFailure(const CHAR8 *Function = __builtin_FUNCTION(),
+                           UINT32 Line = __builtin_LINE());
+void SMB2PrintReceiveFailure(UINT32 Status, const CHAR8 *Function = __builtin_FUNCTION(),
+                             UINT32 Line = __builtin_LINE());
 
 // ---------------------------------------------------------------------------
 // Judging the request layer's NT-style codes

@@ -14,10 +14,6 @@ void PrintInvalidParameter(const CHAR8 *Function, UINT32 Line) {
   Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Invalid Parameter!\n", Function, Line);
 }
 
-void PrintMemoryFailure(const CHAR8 *Function, UINT32 Line) {
-  Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Memory allocation failed!\n", Function, Line);
-}
-
 void PrintNegotiateResponse(const SMB2_NEGOTIATE_RESPONSE *Resp, UINT32 MessageLength) {
   if (!DiagEnabled(DiagChannel::Smb2, DIAG_VERBOSE)) {
     return;
@@ -185,9 +181,7 @@ UINT32 SMB2NegotiateResponse(SMB2_NEGOTIATE_RESPONSE **Response, TRANSACT_DETAIL
   SMB2_HEADER Header;
   INT32 Rx = SMB2ReceiveAll(SockFd, &Header, sizeof(Header), Details);
   if (Rx != 0) {
-    Smb2Log(DIAG_ALWAYS,
-            "Function: %s, Line no.: = %d, TCP_PollAndReceiveMessage failed! Status = 0x%x\n",
-            __func__, __LINE__, Rx);
+    SMB2PrintReceiveFailure(static_cast<UINT32>(Rx));
     return static_cast<UINT32>(Rx);
   }
   UINT32 BodyLength = SMB2BodyLength(&Header);
@@ -217,14 +211,12 @@ UINT32 SMB2NegotiateResponse(SMB2_NEGOTIATE_RESPONSE **Response, TRANSACT_DETAIL
   UINT32 MessageLength = SMB2_FRAMED_HEADER_SIZE + BodyLength;
   UINT8 *Buffer = static_cast<UINT8 *>(AllocateZeroPool(MessageLength + 1));
   if (Buffer == nullptr) {
-    PrintMemoryFailure(__func__, __LINE__);
+    SMB2PrintAllocFailure();
     return STATUS_NO_MEMORY;
   }
   CopyMem(Buffer, &Header, sizeof(Header));
   if (SMB2ReceiveAll(SockFd, Buffer + SMB2_FRAMED_HEADER_SIZE, BodyLength, Details) != 0) {
-    Smb2Log(DIAG_ALWAYS,
-            "Function: %s, Line no.: = %d, TCP_PollAndReceiveMessage failed! Status = 0x%x\n",
-            __func__, __LINE__, Details->TransportStatus);
+    SMB2PrintReceiveFailure(Details->TransportStatus);
     FreePool(Buffer);
     return STATUS_UNSUCCESSFUL;
   }

@@ -303,7 +303,10 @@ EFI_STATUS SMB2NTLMExtractChallenge(const SMB2_NTLM_CHALLENGE *Challenge,
 EFI_STATUS SMB2NTLMAuthenticateBlobConstruct(const SMB2_NTLM_CHALLENGE *Challenge,
                                              TRANSACT_DETAILS *Details, UINT8 **Message,
                                              UINT16 *Length) {
-  if (Challenge == nullptr || Challenge->Message == nullptr || Details == nullptr ||
+  // The challenge's flags are read from its fixed part, so a shorter one is
+  // refused like a missing one.
+  if (Challenge == nullptr || Challenge->Message == nullptr ||
+      Challenge->Length < sizeof(SMB2_NTLMSSP_CHALLENGE_MESSAGE) || Details == nullptr ||
       Message == nullptr || Length == nullptr || Details->ShareDetails.UserName[0] == '\0' ||
       Details->ShareDetails.Password[0] == '\0') {
     DiagNullInput();

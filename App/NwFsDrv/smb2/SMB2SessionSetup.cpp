@@ -12,16 +12,6 @@ namespace {
 constexpr UINT32 kSetupFixedEnd = sizeof(SMB2_SESSION_SETUP_RESPONSE) - SMB2_STREAM_PREFIX_SIZE;
 constexpr UINT64 kFirstSetupMessageId = 1;
 
-void PrintMemoryFailure(const CHAR8 *Function, UINT32 Line) {
-  Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Memory allocation failed!\n", Function, Line);
-}
-
-void PrintReceiveFailure(const CHAR8 *Function, UINT32 Line, UINT32 Status) {
-  Smb2Log(DIAG_ALWAYS,
-          "Function: %s, Line no.: = %d, TCP_PollAndReceiveMessage failed! Status = 0x%x\n",
-          Function, Line, Status);
-}
-
 // Builds and sends one SESSION_SETUP request around Blob.
 UINT32 SendSetup(INT32 SockFd, const UINT8 *Blob, UINT16 BlobLength, TRANSACT_DETAILS *Details) {
   UINT8 *Packet = nullptr;
@@ -46,11 +36,11 @@ UINT32 ReadRemainder(INT32 SockFd, UINT32 Remainder, TRANSACT_DETAILS *Details, 
   }
   UINT8 *Buffer = static_cast<UINT8 *>(AllocateZeroPool(Remainder + 1u));
   if (Buffer == nullptr) {
-    PrintMemoryFailure(__func__, __LINE__);
+    SMB2PrintAllocFailure();
     return STATUS_NO_MEMORY;
   }
   if (Remainder != 0 && SMB2ReceiveAll(SockFd, Buffer, Remainder, Details) != 0) {
-    PrintReceiveFailure(__func__, __LINE__, Details->TransportStatus);
+    SMB2PrintReceiveFailure(Details->TransportStatus);
     FreePool(Buffer);
     return STATUS_UNSUCCESSFUL;
   }
@@ -93,7 +83,7 @@ EFI_STATUS SMB2SessionSetupPacketConstruct(const UINT8 *Blob, UINT16 BlobLength,
   UINT32 Length = sizeof(SMB2_SESSION_SETUP_REQUEST) + Details->SecurityBufferLength;
   UINT8 *Buffer = static_cast<UINT8 *>(AllocateZeroPool(Length + 1u));
   if (Buffer == nullptr) {
-    PrintMemoryFailure(__func__, __LINE__);
+    SMB2PrintAllocFailure();
     return EFI_OUT_OF_RESOURCES;
   }
   SMB2_SESSION_SETUP_REQUEST *Request = reinterpret_cast<SMB2_SESSION_SETUP_REQUEST *>(Buffer);
@@ -142,7 +132,7 @@ UINT32 SMB2SessionChallengeResponse(INT32 SockFd, SMB2_SESSION_SETUP_RESPONSE *R
   Challenge->Message = nullptr;
   Challenge->Length = 0;
   if (SMB2ReceiveAll(SockFd, Response, sizeof(*Response), Details) != 0) {
-    PrintReceiveFailure(__func__, __LINE__, Details->TransportStatus);
+    SMB2PrintReceiveFailure(Details->TransportStatus);
     return STATUS_UNSUCCESSFUL;
   }
   UINT32 StreamLength = SMB2StreamLength(&Response->Header);
@@ -309,7 +299,7 @@ UINT32 SMB2SessionSetupResponse(INT32 SockFd, TRANSACT_DETAILS *Details) {
     Nt = STATUS_UNSUCCESSFUL;
   } else if (SMB2ReceiveAll(SockFd, reinterpret_cast<UINT8 *>(&Response) + sizeof(SMB2_HEADER),
                             kSetupFixedEnd - SMB2_HEADER_STRUCTURE_SIZE, Details) != 0) {
-    PrintReceiveFailure(__func__, __LINE__, Details->TransportStatus);
+    SMB2PrintReceiveFailure(Details->TransportStatus);
     Nt = STATUS_UNSUCCESSFUL;
   } else if (!LocateSecurityBuffer(&Response, StreamLength, &Start)) {
     SMB2DrainBytes(SockFd, StreamLength - kSetupFixedEnd, Details);

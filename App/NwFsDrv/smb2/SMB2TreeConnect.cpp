@@ -57,9 +57,7 @@ UINT32 SimpleResponse(TRANSACT_DETAILS *Details, INT32 SockFd, const CHAR8 *Func
   EFI_STATUS Status = SMB2ReadVerifyHeader(&Header, Details, SockFd, &Nt);
   if (EFI_ERROR(Status)) {
     if (Status == EFI_PROTOCOL_ERROR) {
-      Smb2Log(DIAG_ALWAYS,
-              "Function: %s, Line no.: = %d, TCP_PollAndReceiveMessage failed! Status = 0x%x\n",
-              Function, __LINE__, Details->TransportStatus);
+      SMB2PrintReceiveFailure(Details->TransportStatus, Function, __LINE__);
     }
   } else if (SMB2DrainBytes(SockFd, SMB2BodyLength(&Header), Details) != SMB2_NT_SUCCESS) {
     Nt = STATUS_UNSUCCESSFUL;
@@ -89,8 +87,7 @@ EFI_STATUS SMB2TreeConnectPacketConstruct(const CHAR8 *SharePath, const TRANSACT
       sizeof(SMB2_TREE_CONNECT_REQUEST) + static_cast<UINT32>(Chars) * 2 + kPathTerminatorBytes;
   UINT8 *Buffer = static_cast<UINT8 *>(AllocateZeroPool(Capacity + 1));
   if (Buffer == nullptr) {
-    Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Memory allocation failed!\n", __func__,
-            __LINE__);
+    SMB2PrintAllocFailure();
     return EFI_OUT_OF_RESOURCES;
   }
   UINT16 PathLength = static_cast<UINT16>(
@@ -152,9 +149,7 @@ UINT32 SMB2TreeConnectResponse(TRANSACT_DETAILS *Details, INT32 SockFd) {
   UINT8 *Fixed = reinterpret_cast<UINT8 *>(&Response) + SMB2_FRAMED_HEADER_SIZE;
   if (SMB2ReceiveAll(SockFd, Fixed, kTreeResponseBody, Details) != 0 ||
       SMB2DrainBytes(SockFd, Body - kTreeResponseBody, Details) != SMB2_NT_SUCCESS) {
-    Smb2Log(DIAG_ALWAYS,
-            "Function: %s, Line no.: = %d, TCP_PollAndReceiveMessage failed! Status = 0x%x\n",
-            __func__, __LINE__, Details->TransportStatus);
+    SMB2PrintReceiveFailure(Details->TransportStatus);
     return STATUS_UNSUCCESSFUL;
   }
   // The share's type, flags, capabilities and access are shown, not kept.
