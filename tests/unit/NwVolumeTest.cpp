@@ -463,15 +463,25 @@ TEST_F(NwVolumeTest, DeleteThroughOneHandleInvalidatesTheOthers) {
   UINT64 Position = 0;
   EFI_FILE_PROTOCOL *Out = nullptr;
   for (EFI_FILE_PROTOCOL *H : {A, C}) {
-    Quiet([&] {
+    std::string Text = Console([&] {
       EXPECT_EQ(H->Read(H, &Size, Buffer), EFI_NOT_FOUND);
       EXPECT_EQ(H->GetInfo(H, &gEfiFileInfoGuid, &Size, Buffer), EFI_NOT_FOUND);
+      EXPECT_EQ(H->SetInfo(H, &gEfiFileInfoGuid, Size, Buffer), EFI_NOT_FOUND);
       EXPECT_EQ(H->SetPosition(H, 0), EFI_NOT_FOUND);
       EXPECT_EQ(H->GetPosition(H, &Position), EFI_NOT_FOUND);
       EXPECT_EQ(H->Flush(H), EFI_NOT_FOUND);
       EXPECT_EQ(H->Open(H, &Out, u".", 1, 0), EFI_NOT_FOUND);
       EXPECT_EQ(H->Delete(H), EFI_NOT_FOUND);
     });
+    // Each refusal is reported under the operation's own name.
+    for (const char *Function : {"ReadFileHandle", "GetInfoFileHandle", "SetInfoFileHandle",
+                                 "OpenFileHandle", "DeleteFileHandle"}) {
+      EXPECT_NE(Text.find(std::string("Function: ") + Function + ", Line no.: = "),
+                std::string::npos)
+          << Function;
+    }
+    EXPECT_EQ(Count(Text, " - ValidateCurrentStatus failed!, Status = 14 (0xe)\n"), 5u);
+    EXPECT_EQ(Text.find("operator()"), std::string::npos);
   }
   EXPECT_EQ(A->Close(A), EFI_SUCCESS);
   EXPECT_EQ(C->Close(C), EFI_SUCCESS);

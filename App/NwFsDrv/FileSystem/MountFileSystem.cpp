@@ -90,12 +90,6 @@ EFI_STATUS FindUnicodeCollation(const CHAR8 *Language) {
 // ---------------------------------------------------------------------------
 // Connection parameters and the share record
 // ---------------------------------------------------------------------------
-UINT32 ParseDecimal(const CHAR16 *Text) {
-  CHAR8 Narrow[32];
-  UnicodeStrToAsciiS(Text, Narrow, sizeof(Narrow));
-  return static_cast<UINT32>(AsciiStrDecimalToInt(Narrow));
-}
-
 void FreeConnectionParams(NW_CONNECTION_PARAMS *Params) {
   FreePool(Params->ipAddress);
   FreePool(Params->username);
@@ -110,8 +104,8 @@ EFI_STATUS BuildConnectionParams(const CHAR16 *IpAddress, UINT64 ShareType, cons
   ZeroMem(Params, sizeof(*Params));
   Params->ipAddress = StrDup(IpAddress != nullptr ? IpAddress : u"");
   if (ShareType == NWFS_SHARE_TYPE_NFS) {
-    Params->uid = UserName != nullptr ? ParseDecimal(UserName) : 0;
-    Params->gid = Password != nullptr ? ParseDecimal(Password) : 0;
+    Params->uid = NwParseDecimal(UserName);
+    Params->gid = NwParseDecimal(Password);
   } else {
     Params->username = StrDup(UserName != nullptr ? UserName : u"");
     Params->password = StrDup(Password != nullptr ? Password : u"");
@@ -336,8 +330,10 @@ EFI_STATUS EFIAPI MountStaticFileSystem(const CHAR16 *ShareName, const CHAR16 *I
             static_cast<UINT32>(Status));
     FreeShareRecord(Share); // nothing refers to it after a failed connect
   } else {
-    Status = DetectInstallVolume(gImageHandle, Language, Share, Params.ipAddress, Params.username,
-                                 Params.password);
+    // The arguments as given: for NFS the volume keeps the uid and gid they
+    // spell, which the connection copies hold only as numbers.
+    Status =
+        DetectInstallVolume(gImageHandle, Language, Share, Params.ipAddress, UserName, Password);
     if (!EFI_ERROR(Status)) {
       Status = StartKeepAlive(Share);
     } else {

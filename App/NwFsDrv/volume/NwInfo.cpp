@@ -322,9 +322,8 @@ EFI_STATUS EFIAPI GetInfoFileHandle(EFI_FILE_PROTOCOL *This, const EFI_GUID *Inf
                                     UINTN *BufferSize, void *Buffer) {
   return NwTraced([&]() -> EFI_STATUS {
     NW_FILE_HANDLE *Handle = NwHandleOf(This);
-    EFI_STATUS Status = ValidateCurrentStatus(Handle);
+    EFI_STATUS Status = NwValidateHandle(Handle, "GetInfoFileHandle");
     if (EFI_ERROR(Status)) {
-      DiagError("ValidateCurrentStatus failed!", Status);
       return Status;
     }
     if (InformationType == nullptr || BufferSize == nullptr) {
@@ -347,9 +346,8 @@ EFI_STATUS EFIAPI SetInfoFileHandle(EFI_FILE_PROTOCOL *This, const EFI_GUID *Inf
                                     UINTN BufferSize, void *Buffer) {
   return NwTraced([&]() -> EFI_STATUS {
     NW_FILE_HANDLE *Handle = NwHandleOf(This);
-    EFI_STATUS Status = ValidateCurrentStatus(Handle);
+    EFI_STATUS Status = NwValidateHandle(Handle, "SetInfoFileHandle");
     if (EFI_ERROR(Status)) {
-      DiagError("ValidateCurrentStatus failed!", Status);
       return Status;
     }
     if (InformationType == nullptr || Buffer == nullptr) {

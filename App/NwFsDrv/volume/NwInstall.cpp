@@ -8,16 +8,6 @@ EFI_UNICODE_COLLATION_PROTOCOL *gUnicodeCollationInterface = nullptr;
 namespace {
 
 constexpr UINTN kLanguageBytes = 9;
-constexpr UINTN kNumberChars = 32;
-
-UINT32 ParseDecimal(const CHAR16 *Text) {
-  if (Text == nullptr) {
-    return 0;
-  }
-  CHAR8 Narrow[kNumberChars];
-  UnicodeStrToAsciiS(Text, Narrow, kNumberChars);
-  return static_cast<UINT32>(AsciiStrDecimalToInt(Narrow));
-}
 
 // One connection string copy; the failure line names the field.
 bool CopyConnectionString(const CHAR16 *Source, CHAR16 **Destination, const CHAR8 *Field) {
@@ -43,8 +33,8 @@ EFI_STATUS FillConnectionInfo(NW_VOLUME *Volume, const CHAR16 *IpAddress, const 
     return EFI_INVALID_PARAMETER;
   }
   if (Volume->shareInfo != nullptr && Volume->shareInfo->shareType == NW_SHARE_TYPE_NFS) {
-    Info->uid = ParseDecimal(UserName);
-    Info->gid = ParseDecimal(Password);
+    Info->uid = NwParseDecimal(UserName);
+    Info->gid = NwParseDecimal(Password);
     return EFI_SUCCESS;
   }
   if (!CopyConnectionString(UserName, &Info->username, "username") ||
@@ -78,6 +68,16 @@ void LinkShare(NW_VOLUME *Volume, NW_SHARE_INFO *ShareInfo) {
 }
 
 } // namespace
+
+UINT32 NwParseDecimal(const CHAR16 *Text) {
+  constexpr UINTN kNumberChars = 32;
+  if (Text == nullptr) {
+    return 0;
+  }
+  CHAR8 Narrow[kNumberChars];
+  UnicodeStrToAsciiS(Text, Narrow, kNumberChars);
+  return static_cast<UINT32>(AsciiStrDecimalToInt(Narrow));
+}
 
 EFI_STATUS DetectInstallVolume(EFI_HANDLE Handle, const CHAR8 *Language, NW_SHARE_INFO *ShareInfo,
                                const CHAR16 *IpAddress, const CHAR16 *UserName,

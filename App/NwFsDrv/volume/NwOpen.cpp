@@ -396,9 +396,8 @@ EFI_STATUS EFIAPI OpenFileHandle(EFI_FILE_PROTOCOL *This, EFI_FILE_PROTOCOL **Ne
         (OpenMode & EFI_FILE_MODE_WRITE) != 0) {
       return EFI_WRITE_PROTECTED;
     }
-    EFI_STATUS Status = ValidateCurrentStatus(Handle);
+    EFI_STATUS Status = NwValidateHandle(Handle, "OpenFileHandle");
     if (EFI_ERROR(Status)) {
-      DiagError("ValidateCurrentStatus failed!", Status);
       return Status;
     }
     // Attributes outside the valid set answer "not found" rather than "invalid

@@ -245,6 +245,14 @@ EFI_STATUS ValidateCurrentStatus(NW_FILE_HANDLE *Handle) {
   return EFI_ERROR(VolumeStatus) ? VolumeStatus : EFI_SUCCESS;
 }
 
+EFI_STATUS NwValidateHandle(NW_FILE_HANDLE *Handle, const CHAR8 *Function, UINT32 Line) {
+  EFI_STATUS Status = ValidateCurrentStatus(Handle);
+  if (EFI_ERROR(Status)) {
+    DiagError("ValidateCurrentStatus failed!", Status, Function, Line);
+  }
+  return Status;
+}
+
 EFI_STATUS ReleaseOpenFile(NW_OPEN_FILE *OpenFile) {
   while (OpenFile != nullptr) {
     if (RecordInUse(OpenFile)) {

@@ -190,9 +190,8 @@ EFI_STATUS EFIAPI ReadFileHandle(EFI_FILE_PROTOCOL *This, UINTN *BufferSize, voi
     }
     DiagLog(DIAG_VERBOSE, "BufferSize = 0x%x (%ld)\n", static_cast<UINT32>(*BufferSize),
             static_cast<UINT64>(*BufferSize));
-    EFI_STATUS Status = ValidateCurrentStatus(Handle);
+    EFI_STATUS Status = NwValidateHandle(Handle, "ReadFileHandle");
     if (EFI_ERROR(Status)) {
-      DiagError("ValidateCurrentStatus failed!", Status);
       return Status;
     }
     if (Buffer == nullptr && *BufferSize != 0) {
@@ -324,9 +323,8 @@ EFI_STATUS EFIAPI CloseFileHandle(EFI_FILE_PROTOCOL *This) {
 EFI_STATUS EFIAPI DeleteFileHandle(EFI_FILE_PROTOCOL *This) {
   return NwTraced([&]() -> EFI_STATUS {
     NW_FILE_HANDLE *Handle = NwHandleOf(This);
-    EFI_STATUS Status = ValidateCurrentStatus(Handle);
+    EFI_STATUS Status = NwValidateHandle(Handle, "DeleteFileHandle");
     if (EFI_ERROR(Status)) {
-      DiagError("ValidateCurrentStatus failed!", Status);
       return Status;
     }
     NW_OPEN_FILE *OpenFile = Handle->OpenFile;

@@ -176,9 +176,12 @@ extern EFI_UNICODE_COLLATION_PROTOCOL *gUnicodeCollationInterface;
 // ---------------------------------------------------------------------------
 // Volume install and removal
 // ---------------------------------------------------------------------------
+// For an NFS share the user name and password are the decimal uid and gid.
 EFI_STATUS DetectInstallVolume(EFI_HANDLE Handle, const CHAR8 *Language, NW_SHARE_INFO *ShareInfo,
                                const CHAR16 *IpAddress, const CHAR16 *UserName,
                                const CHAR16 *Password);
+// A decimal number given as text (an NFS uid or gid); 0 for no text.
+UINT32 NwParseDecimal(const CHAR16 *Text);
 // Uninstalls the volume's Simple File System interface and frees everything
 // the volume owns: handles, open-file records, listings, label, connection
 // strings, controller name and the record itself. The share record stays the
@@ -200,6 +203,11 @@ EFI_STATUS CreateRootRecord(NW_VOLUME *Volume, NW_OPEN_FILE **Root);
 EFI_STATUS CreateFileHandleInstance(NW_OPEN_FILE *OpenFile, NW_FILE_HANDLE **Handle,
                                     UINT64 OpenMode);
 EFI_STATUS ValidateCurrentStatus(NW_FILE_HANDLE *Handle);
+// ValidateCurrentStatus with a failure reported as "ValidateCurrentStatus
+// failed!" under the protocol operation's own name (given explicitly: the
+// operations run their bodies inside NwTraced's lambda).
+EFI_STATUS NwValidateHandle(NW_FILE_HANDLE *Handle, const CHAR8 *Function,
+                            UINT32 Line = __builtin_LINE());
 // Frees a record that no handle, cached listing or child record refers to,
 // unlinking it from the volume and its parent, and then tries its parent the
 // same way. A record still in use (or the volume's root) is left alone and
