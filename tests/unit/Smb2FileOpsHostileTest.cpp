@@ -234,6 +234,10 @@ TEST_F(Smb2FileOpsHostileTest, DirectoryAnswersThatPointOutsideThemselves) {
   Expect([](uint64_t Id) { return CreateAnswer(Id); });
   Expect([](uint64_t Id) { return QueryAnswer(14, Id, Bytes(16400, 0)); });
   Expect([](uint64_t Id) { return CloseAnswer(Id); });
+  // A successful answer without output: nothing to walk, no first entry.
+  Expect([](uint64_t Id) { return CreateAnswer(Id); });
+  Expect([](uint64_t Id) { return QueryAnswer(14, Id, Bytes()); });
+  Expect([](uint64_t Id) { return CloseAnswer(Id); });
   ScriptDisconnect();
   Connect();
   for (const Case &C : Cases) {
@@ -253,6 +257,12 @@ TEST_F(Smb2FileOpsHostileTest, DirectoryAnswersThatPointOutsideThemselves) {
   EXPECT_TRUE(Contains(Out, "OutputBufferLength 16400 is beyond the 16400 bytes that follow or the "
                             "16384 bytes asked for!"))
       << Out;
+  EXPECT_EQ(FindFirst(&Out, &Entry), EFI_INVALID_PARAMETER);
+  EXPECT_TRUE(Contains(Out, "QueryDirResp->OutputBufferLength is 0!\n")) << Out;
+  EXPECT_TRUE(Contains(Out, "FileAccessDetails.FullDirInfoPtr is NULL!\n")) << Out;
+  EXPECT_TRUE(Contains(Out, "SMB2_PopulateFileInfo failed!")) << Out;
+  EXPECT_EQ(Entry, nullptr);
+  EXPECT_EQ(gDirNodePtr, nullptr);
   EXPECT_EQ(Server.Failure(), "");
 }
 

@@ -29,21 +29,8 @@ void LogNull(const CHAR8 *Function, UINT32 Line) {
   DiagNullInput(DiagChannel::Smb2, Function, Line);
 }
 
-void LogAllocationFailure(const CHAR8 *Function, UINT32 Line) {
-  Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Memory allocation failed!\n", Function, Line);
-}
-
 UINT32 RoundUp(UINT32 Value, UINT32 Alignment) {
   return (Value + Alignment - 1) / Alignment * Alignment;
-}
-
-bool IsZeroFileId(const UINT8 *FileId) {
-  for (UINTN I = 0; I < SMB2_FILE_ID_SIZE; I++) {
-    if (FileId[I] != 0) {
-      return false;
-    }
-  }
-  return true;
 }
 
 void FillContextHeader(SMB2_CREATE_CONTEXT_HEADER *Header, const CHAR8 *Name, UINT32 DataLength) {
@@ -200,6 +187,15 @@ UINT32 SMB2ReadResponseStart(INT32 SockFd, SMB2_HEADER *Header, void *Body, UINT
   return SMB2_NT_SUCCESS;
 }
 
+bool SMB2IsZeroFileId(const UINT8 *FileId) {
+  for (UINTN I = 0; I < SMB2_FILE_ID_SIZE; I++) {
+    if (FileId[I] != 0) {
+      return false;
+    }
+  }
+  return true;
+}
+
 UINT32 SMB2ConstructFailureCode(EFI_STATUS Status) {
   if (Status == EFI_INVALID_PARAMETER) {
     return SMB2_NT_INVALID_PARAMETER;
@@ -226,7 +222,7 @@ EFI_STATUS SMB2CreateLeaseBuf(const UINT8 *LeaseKey, UINT8 OplockLevel, UINT8 **
   auto *Lease =
       static_cast<SMB2_CREATE_LEASE_CONTEXT *>(AllocateZeroPool(sizeof(SMB2_CREATE_LEASE_CONTEXT)));
   if (Lease == nullptr) {
-    LogAllocationFailure(__func__, __LINE__);
+    SMB2PrintAllocFailure(__func__, __LINE__);
     return EFI_OUT_OF_RESOURCES;
   }
   FillContextHeader(&Lease->Header, "RqLs", kLeaseDataLength);
@@ -245,7 +241,7 @@ EFI_STATUS SMB2CreateDurableBuf(const UINT8 *LeaseKey, UINT8 OplockLevel, UINT8 
   auto *Durable = static_cast<SMB2_CREATE_DURABLE_CONTEXT *>(
       AllocateZeroPool(sizeof(SMB2_CREATE_DURABLE_CONTEXT)));
   if (Durable == nullptr) {
-    LogAllocationFailure(__func__, __LINE__);
+    SMB2PrintAllocFailure(__func__, __LINE__);
     return EFI_OUT_OF_RESOURCES;
   }
   FillContextHeader(&Durable->Header, "DHnQ", kDurableDataLength);
@@ -287,7 +283,7 @@ EFI_STATUS SMB2CreateContextRequestPacketConstruct(SMB2_CREATE_REQUEST *Packet,
   if (Characters > 0) {
     *Name = static_cast<UINT8 *>(AllocateZeroPool(Padded));
     if (*Name == nullptr) {
-      LogAllocationFailure(__func__, __LINE__);
+      SMB2PrintAllocFailure(__func__, __LINE__);
       return EFI_OUT_OF_RESOURCES;
     }
     strtoUTF16(*Name, Access->FileName, SMB2_FILE_NAME_LIMIT, "default");
@@ -404,7 +400,7 @@ EFI_STATUS SMB2VerifyCreateResponse(const SMB2_CREATE_RESPONSE *Packet,
     LogNull(__func__, __LINE__);
     return EFI_INVALID_PARAMETER;
   }
-  if (IsZeroFileId(Packet->Body.FileId)) {
+  if (SMB2IsZeroFileId(Packet->Body.FileId)) {
     Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, CreateResp->FileId is 0! - 0x", __func__,
             __LINE__);
     for (UINTN I = 0; I < SMB2_FILE_ID_SIZE; I++) {

@@ -570,6 +570,8 @@ UINT32 SMB2ReadResponseStart(INT32 SockFd, SMB2_HEADER *Header, void *Body, UINT
                              UINT32 Line = __builtin_LINE());
 // Consumes what is left of a message after Consumed of its body bytes.
 UINT32 SMB2DrainMessageRest(INT32 SockFd, const SMB2_HEADER *Header, UINT64 Consumed);
+// True when all 16 bytes of a file id are zero (no file open).
+bool SMB2IsZeroFileId(const UINT8 *FileId);
 // The NT-style code a request function returns when its packet could not be
 // built: invalid parameter, no memory, or unsuccessful.
 UINT32 SMB2ConstructFailureCode(EFI_STATUS Status);
@@ -690,5 +692,6 @@ EFI_STATUS SMB2_AddDirNode(SMB2_DIR_NODE **Head, SMB2_DIR_NODE *Node);
 EFI_STATUS SMB2_PopulateDirInfo(const UINT8 *Entry, SMB2_DIR_NODE *Node);
 // Turns the answer held by Access->FullDirInfoPtr into nodes appended at
 // *Head, checking every entry against the answer's bounds, and releases the
-// answer copy whatever the outcome.
+// answer copy whatever the outcome. Without an answer it succeeds and
+// appends nothing.
 EFI_STATUS SMB2WalkDirectoryAnswer(FILE_ACCESS_DETAILS *Access, SMB2_DIR_NODE **Head);

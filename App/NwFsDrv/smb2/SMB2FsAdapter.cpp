@@ -38,15 +38,6 @@ EFI_STATUS InvalidParameter(const CHAR8 *Function) {
   return EFI_INVALID_PARAMETER;
 }
 
-bool FileIdIsZero(const UINT8 *FileId) {
-  for (UINTN I = 0; I < SMB2_FILE_ID_SIZE; I++) {
-    if (FileId[I] != 0) {
-      return false;
-    }
-  }
-  return true;
-}
-
 // Names are relative to the share root: a leading separator of the
 // volume's full path is dropped. At most MaxChars characters are kept.
 void SetRemoteName(const CHAR8 *Name, UINTN MaxChars) {
@@ -110,7 +101,7 @@ void PrepareTransfer(const NW_REMOTE_FILE *File, UINT64 Offset, UINT32 Length) {
 // tells the caller to close it again.
 EFI_STATUS OpenIfNoneOpen(bool *Opened) {
   *Opened = false;
-  if (!FileIdIsZero(Access().FileId)) {
+  if (!SMB2IsZeroFileId(Access().FileId)) {
     return EFI_SUCCESS;
   }
   SetReadOnlyOpen(SMB2_OPLOCK_LEVEL_NONE);
@@ -478,7 +469,7 @@ EFI_STATUS SMB2_GetFSInfo(NW_SHARE_INFO *Volume, EFI_FILE_SYSTEM_INFO *Info) {
   if (Volume == nullptr || Info == nullptr) {
     return InvalidParameter(__func__);
   }
-  if (FileIdIsZero(Access().FileId)) {
+  if (SMB2IsZeroFileId(Access().FileId)) {
     Smb2Log(DIAG_VERBOSE, "%s: Trying to open as FileId is 0\n", __func__);
   }
   bool Opened = false;
@@ -511,7 +502,7 @@ EFI_STATUS SMB2_FindFirst(NW_SHARE_INFO *Share, const CHAR16 *Pattern, EFI_FILE_
   *Entry = nullptr;
   // A listing left unfinished ends here.
   ReleaseListing();
-  if (FileIdIsZero(Access().FileId)) {
+  if (SMB2IsZeroFileId(Access().FileId)) {
     CHAR8 Path[kSharePathChars + 1];
     AsciiStrCpyS(Path, sizeof(Path), Share->FilePath);
     SetRemoteName(Path, kSharePathChars);
@@ -543,6 +534,8 @@ EFI_STATUS SMB2_FindFirst(NW_SHARE_INFO *Share, const CHAR16 *Pattern, EFI_FILE_
     ReleaseListing();
     DiagError("Read directory error!", Status);
   } else {
+    // An answer without entries leaves the list empty, and the absent first
+    // entry is refused below.
     gDirNodeCursor = gDirNodePtr;
     Status = SMB2_PopulateDirFileInfo(gDirNodeCursor, Entry);
     if (EFI_ERROR(Status)) {
@@ -573,7 +566,7 @@ EFI_STATUS SMB2_GetFileStat(NW_SHARE_INFO *Volume, const CHAR16 *Path, EFI_FILE_
   if (Volume == nullptr || Path == nullptr || Stat == nullptr) {
     return InvalidParameter(__func__);
   }
-  if (FileIdIsZero(Access().FileId)) {
+  if (SMB2IsZeroFileId(Access().FileId)) {
     SetRemoteNameWide(Path, kRemoteNameChars);
   }
   bool Opened = false;

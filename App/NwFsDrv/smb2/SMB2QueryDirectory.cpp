@@ -234,8 +234,11 @@ EFI_STATUS SMB2WalkDirectoryAnswer(FILE_ACCESS_DETAILS *Access, SMB2_DIR_NODE **
     return EFI_INVALID_PARAMETER;
   }
   if (Access->FullDirInfoPtr == nullptr) {
+    // No answer to walk (an empty output, or its copy could not be made):
+    // the walk stops without nodes and without failing; the caller finds
+    // the list empty.
     Smb2Log(DIAG_ALWAYS, "FileAccessDetails.FullDirInfoPtr is NULL!\n");
-    return EFI_NOT_FOUND;
+    return EFI_SUCCESS;
   }
   const UINT8 *Base = Access->FullDirInfoPtr;
   UINT64 Length = Access->FullDirInfoLength;

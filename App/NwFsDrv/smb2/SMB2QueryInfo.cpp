@@ -55,8 +55,7 @@ UINT8 *CopyDirectoryAnswer(const UINT8 *Output, UINT32 Length) {
   UINT8 *Copy =
       static_cast<UINT8 *>(AllocateZeroPool(static_cast<UINTN>(Length) + SMB2_DIR_INFO_SLACK));
   if (Copy == nullptr) {
-    Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Memory allocation failed!\n",
-            "SMB2VerifyInfoStructure", __LINE__);
+    SMB2PrintAllocFailure("SMB2VerifyInfoStructure", __LINE__);
     return nullptr;
   }
   CopyMem(Copy, Output, Length);
@@ -152,8 +151,7 @@ UINT32 SMB2ReadQueryResponse(INT32 SockFd, SMB2_QUERY_RESPONSE *Packet, const QU
   }
   UINT8 *Output = static_cast<UINT8 *>(AllocateZeroPool(static_cast<UINTN>(Length) + 1));
   if (Output == nullptr) {
-    Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Memory allocation failed!\n", Function,
-            Line);
+    SMB2PrintAllocFailure(Function, Line);
     SMB2DrainMessageRest(SockFd, &Packet->Header, kFixed);
     return SMB2_NT_OUT_OF_MEMORY;
   }

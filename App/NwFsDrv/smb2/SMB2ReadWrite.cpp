@@ -88,8 +88,7 @@ EFI_STATUS SMB2ReadPacketConstruct(SMB2_READ_REQUEST *Packet, const TRANSACT_DET
     *ChannelCopy = static_cast<UINT8 *>(AllocateCopyPool(ChannelLength, Rw.ChannelInfo));
     if (*ChannelCopy == nullptr) {
       // Deliberately reported as an invalid parameter.
-      Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Memory allocation failed!\n", __func__,
-              __LINE__);
+      SMB2PrintAllocFailure(__func__, __LINE__);
       return EFI_INVALID_PARAMETER;
     }
   } else if (ChannelLength == 0) {

@@ -13,8 +13,6 @@ NETWORK_BUSY_LOCK NetworkBusyLock;
 
 namespace {
 
-BOOLEAN gNWLibInitialized = FALSE;
-
 // Records the status of an operation; the recording's own result is
 // deliberately not passed on.
 EFI_STATUS Recorded(EFI_STATUS Status) {
@@ -63,10 +61,10 @@ EFI_STATUS GEE_NWInit(EFI_HANDLE ImageHandle, EFI_SYSTEM_TABLE *SystemTable, UIN
   (void)ImageHandle;
   (void)SystemTable;
   (void)ShareType; // every share type reaches the SMB2 adapter
+  // The initialised flag is the mount code's, set there on success.
   if (EFI_ERROR(SMB2_FSResetState())) {
     return EFI_DEVICE_ERROR;
   }
-  gNWLibInitialized = TRUE;
   return EFI_SUCCESS;
 }
 
