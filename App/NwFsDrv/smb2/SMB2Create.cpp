@@ -146,7 +146,10 @@ UINT32 SMB2SendFileRequest(INT32 SockFd, const SMB2_SEND_PIECE *Pieces, UINT32 C
     Message = Assembled;
   }
   UINT32 Transport = 0;
-  UINT32 Code = SMB2SendRequest(SockFd, Message, Total, &Transport);
+  // A request assembled here already sits in a buffer of its own; a single
+  // piece gets its one copy from the send loop.
+  UINT32 Code = Assembled != nullptr ? SMB2SendAll(SockFd, Assembled, Total, &Transport)
+                                     : SMB2SendRequest(SockFd, Message, Total, &Transport);
   TransactDetails.TransportStatus = Transport;
   if (Code != SMB2_NT_SUCCESS) {
     Smb2Log(DIAG_ALWAYS,

@@ -87,6 +87,39 @@ void SMB2HeaderFill(SMB2_HEADER *Header, UINT16 Command, UINT32 TotalLength,
   Header->SessionId = Command == SMB2_NEGOTIATE ? 0 : Details->SessionId;
 }
 
+UINT32 SMB2SendAll(INT32 SockFd, const UINT8 *Bytes, UINT64 Length, UINT32 *TransportStatus) {
+  if (Bytes == nullptr || TransportStatus == nullptr) {
+    DiagNullInput();
+    return SMB2_NT_INVALID_PARAMETER;
+  }
+  if (Length == 0) {
+    DiagError("Error! Bytes to be sent is zero!", EFI_INVALID_PARAMETER);
+    return STATUS_UNSUCCESSFUL;
+  }
+  UINT64 Offset = 0;
+  INT32 Status = 0;
+  while (Offset < Length) {
+    INT64 Sent = 0;
+    Status = TCP_SendMessage(SockFd, Bytes + Offset, static_cast<INT64>(Length - Offset), &Sent);
+    if (Status == 0 && Sent <= 0) {
+      Status = -1; // a send that moves nothing would never finish
+    }
+    *TransportStatus = static_cast<UINT32>(Status);
+    if (Status != 0) {
+      Smb2Log(DIAG_ALWAYS,
+              "Function: %s, Line no.: = %d, TCP_SendMessage failed! Status = 0x%x, Bytes sent "
+              "= %ld\n",
+              "SMB2SendRequest", __LINE__, Status, static_cast<INT64>(Offset));
+      break;
+    }
+    Offset += static_cast<UINT64>(Sent);
+  }
+  if (Status == 0) {
+    Smb2Log(DIAG_VERBOSE, "All bytes %ld written!\n", static_cast<INT64>(Offset));
+  }
+  return static_cast<UINT32>(Status);
+}
+
 UINT32 SMB2SendRequest(INT32 SockFd, const void *Request, UINT64 Length, UINT32 *TransportStatus) {
   if (Request == nullptr || TransportStatus == nullptr) {
     DiagNullInput();
@@ -102,33 +135,13 @@ UINT32 SMB2SendRequest(INT32 SockFd, const void *Request, UINT64 Length, UINT32 
     return STATUS_NO_MEMORY;
   }
   CopyMem(Copy, Request, Length);
-  UINT64 Offset = 0;
-  INT32 Status = 0;
-  while (Offset < Length) {
-    INT64 Sent = 0;
-    Status = TCP_SendMessage(SockFd, Copy + Offset, static_cast<INT64>(Length - Offset), &Sent);
-    if (Status == 0 && Sent <= 0) {
-      Status = -1; // a send that moves nothing would never finish
-    }
-    *TransportStatus = static_cast<UINT32>(Status);
-    if (Status != 0) {
-      Smb2Log(DIAG_ALWAYS,
-              "Function: %s, Line no.: = %d, TCP_SendMessage failed! Status = 0x%x, Bytes sent "
-              "= %ld\n",
-              __func__, __LINE__, Status, static_cast<INT64>(Offset));
-      break;
-    }
-    Offset += static_cast<UINT64>(Sent);
-  }
-  if (Status == 0) {
-    Smb2Log(DIAG_VERBOSE, "All bytes %ld written!\n", static_cast<INT64>(Offset));
-  }
+  UINT32 Status = SMB2SendAll(SockFd, Copy, Length, TransportStatus);
   FreePool(Copy);
-  return static_cast<UINT32>(Status);
+  return Status;
 }
 
 UINT32 SMB2SendAndFree(INT32 SockFd, UINT8 *Packet, UINT64 Length, UINT32 *TransportStatus) {
-  UINT32 Sent = SMB2SendRequest(SockFd, Packet, Length, TransportStatus);
+  UINT32 Sent = SMB2SendAll(SockFd, Packet, Length, TransportStatus);
   if (Packet != nullptr) {
     ZeroMem(Packet, Length);
     FreePool(Packet);

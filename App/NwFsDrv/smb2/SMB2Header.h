@@ -242,8 +242,11 @@ void SMB2HeaderFill(SMB2_HEADER *Header, UINT16 Command, UINT32 TotalLength,
 // STATUS_NO_MEMORY, or the failing transport status (also stored in
 // *TransportStatus, which receives the last send's status in every case).
 UINT32 SMB2SendRequest(INT32 SockFd, const void *Request, UINT64 Length, UINT32 *TransportStatus);
-// SMB2SendRequest for a request built in pool memory, which is scrubbed and
-// freed afterwards.
+// The loop alone, for a request already assembled in a buffer of its own
+// (no further copy).
+UINT32 SMB2SendAll(INT32 SockFd, const UINT8 *Bytes, UINT64 Length, UINT32 *TransportStatus);
+// The loop for a request built in pool memory, which is scrubbed and freed
+// afterwards.
 UINT32 SMB2SendAndFree(INT32 SockFd, UINT8 *Packet, UINT64 Length, UINT32 *TransportStatus);
 // The session exchanges' verdict on a send: success and STATUS_NO_MEMORY
 // stand, any transport failure becomes STATUS_UNSUCCESSFUL.
