@@ -15,7 +15,6 @@
 #include <chrono>
 #include <fstream>
 #include <random>
-#include <sstream>
 #include <string>
 #include <vector>
 
@@ -92,8 +91,6 @@ protected:
     Smb2HostTest::TearDown();
   }
 
-  static void Quiet(const std::function<void()> &Body) { Console(Body); }
-
   // What the mount does: initialise, connect, install the volume (on the
   // image handle, which carries the image's device path so that the shell
   // can map the volume).
@@ -152,8 +149,7 @@ protected:
     chmod(Path.c_str(), Mode);
   }
   std::vector<UINT8> GetFile(const std::string &Relative) {
-    std::ifstream In(Local + "/" + Relative, std::ios::binary);
-    return std::vector<UINT8>(std::istreambuf_iterator<char>(In), {});
+    return ReadBytes(Local + "/" + Relative);
   }
   bool Exists(const std::string &Relative) {
     return std::filesystem::exists(Local + "/" + Relative);
@@ -165,27 +161,19 @@ protected:
 
   EFI_FILE_PROTOCOL *OpenRoot() {
     EFI_FILE_PROTOCOL *Root = nullptr;
-    EFI_STATUS Status = EFI_SUCCESS;
-    Quiet([&] { Status = Sfs->OpenVolume(Sfs, &Root); });
-    EXPECT_EQ(Status, EFI_SUCCESS);
+    EXPECT_EQ(Quiet([&] { return Sfs->OpenVolume(Sfs, &Root); }), EFI_SUCCESS);
     return Root;
   }
   EFI_STATUS Open(EFI_FILE_PROTOCOL *From, const std::u16string &Path, EFI_FILE_PROTOCOL **File,
                   UINT64 Mode = kRead, UINT64 Attributes = 0) {
-    EFI_STATUS Status = EFI_SUCCESS;
-    Quiet([&] { Status = From->Open(From, File, Path.c_str(), Mode, Attributes); });
-    return Status;
+    return Quiet([&] { return From->Open(From, File, Path.c_str(), Mode, Attributes); });
   }
   EFI_STATUS Read(EFI_FILE_PROTOCOL *File, UINTN *Size, void *Buffer) {
-    EFI_STATUS Status = EFI_SUCCESS;
-    Quiet([&] { Status = File->Read(File, Size, Buffer); });
-    return Status;
+    return Quiet([&] { return File->Read(File, Size, Buffer); });
   }
   EFI_STATUS Write(EFI_FILE_PROTOCOL *File, const std::vector<UINT8> &Data, UINTN *Size) {
-    EFI_STATUS Status = EFI_SUCCESS;
     *Size = Data.size();
-    Quiet([&] { Status = File->Write(File, Size, const_cast<UINT8 *>(Data.data())); });
-    return Status;
+    return Quiet([&] { return File->Write(File, Size, const_cast<UINT8 *>(Data.data())); });
   }
   void Close(EFI_FILE_PROTOCOL *File) {
     Quiet([&] { File->Close(File); });
@@ -193,16 +181,15 @@ protected:
   std::vector<UINT8> Info(EFI_FILE_PROTOCOL *File, const EFI_GUID &Type, EFI_STATUS *Status,
                           UINTN *Needed = nullptr) {
     UINTN Size = 0;
-    Quiet([&] { *Status = File->GetInfo(File, &Type, &Size, nullptr); });
+    *Status = Quiet([&] { return File->GetInfo(File, &Type, &Size, nullptr); });
     if (Needed != nullptr) {
       *Needed = Size;
     }
-    if (*Status != EFI_BUFFER_TOO_SMALL) {
-      return {};
-    }
     std::vector<UINT8> Buffer(Size);
-    Quiet([&] { *Status = File->GetInfo(File, &Type, &Size, Buffer.data()); });
-    Buffer.resize(Size);
+    if (*Status == EFI_BUFFER_TOO_SMALL) {
+      *Status = Quiet([&] { return File->GetInfo(File, &Type, &Size, Buffer.data()); });
+    }
+    Buffer.resize(*Status == EFI_SUCCESS ? Size : 0);
     return Buffer;
   }
   // Names from directory Reads until one returns nothing (at most Limit).
@@ -251,10 +238,6 @@ protected:
       Drive += u':';
     }
     return Drive;
-  }
-  std::vector<UINT8> RamfsFile(const std::string &Name) {
-    std::ifstream In(Dir + "/ramfs/" + Name, std::ios::binary);
-    return std::vector<UINT8>(std::istreambuf_iterator<char>(In), {});
   }
 
   std::vector<SMB2_REQUEST_TRACE> RequestsSince(UINT64 Count, UINT16 Command) {
@@ -588,8 +571,10 @@ TEST_F(NwVolumeSambaTest, SetInfoRenamesLocallyAndChangesSizesLocally) {
   // Firmware shells find the root by its empty name when they build paths.
   ASSERT_EQ(RootInfo.size(), 84u);
   EXPECT_EQ(reinterpret_cast<const EFI_FILE_INFO *>(RootInfo.data())->FileName[0], u'\0');
-  Quiet([&] { Status = Root->SetInfo(Root, &gEfiFileInfoGuid, RootInfo.size(), RootInfo.data()); });
-  EXPECT_EQ(Status, EFI_ACCESS_DENIED);
+  EXPECT_EQ(Quiet([&] {
+              return Root->SetInfo(Root, &gEfiFileInfoGuid, RootInfo.size(), RootInfo.data());
+            }),
+            EFI_ACCESS_DENIED);
 
   EFI_FILE_PROTOCOL *File = nullptr;
   ASSERT_EQ(Open(Root, At("old.txt"), &File, kReadWrite), EFI_SUCCESS);
@@ -597,20 +582,19 @@ TEST_F(NwVolumeSambaTest, SetInfoRenamesLocallyAndChangesSizesLocally) {
   ASSERT_EQ(Status, EFI_SUCCESS);
   // A new name: the handle moves to it; the server is not asked to rename.
   std::u16string NewName = u"new.txt";
-  std::vector<UINT8> Renamed(SIZE_OF_EFI_FILE_INFO + 2 * (NewName.size() + 1));
-  std::copy(Buffer.begin(), Buffer.begin() + SIZE_OF_EFI_FILE_INFO, Renamed.begin());
-  std::copy(NewName.begin(), NewName.end(),
-            reinterpret_cast<CHAR16 *>(Renamed.data() + SIZE_OF_EFI_FILE_INFO));
-  Quiet([&] { Status = File->SetInfo(File, &gEfiFileInfoGuid, Renamed.size(), Renamed.data()); });
-  ASSERT_EQ(Status, EFI_SUCCESS);
+  std::vector<UINT8> Renamed = NamedInfo(Buffer, NewName);
+  ASSERT_EQ(
+      Quiet([&] { return File->SetInfo(File, &gEfiFileInfoGuid, Renamed.size(), Renamed.data()); }),
+      EFI_SUCCESS);
   std::vector<UINT8> After = Info(File, gEfiFileInfoGuid, &Status);
   EXPECT_EQ(std::u16string(reinterpret_cast<EFI_FILE_INFO *>(After.data())->FileName), NewName);
   EXPECT_TRUE(GetFile("old.txt") == (std::vector<UINT8>{'o', 'l', 'd'}));
   // A size change is acknowledged and not sent.
   auto *Request = reinterpret_cast<EFI_FILE_INFO *>(After.data());
   Request->FileSize = 1;
-  Quiet([&] { Status = File->SetInfo(File, &gEfiFileInfoGuid, After.size(), After.data()); });
-  EXPECT_EQ(Status, EFI_SUCCESS);
+  EXPECT_EQ(
+      Quiet([&] { return File->SetInfo(File, &gEfiFileInfoGuid, After.size(), After.data()); }),
+      EFI_SUCCESS);
   EXPECT_EQ(GetFile("old.txt").size(), 3u);
   Close(File);
 
@@ -618,8 +602,9 @@ TEST_F(NwVolumeSambaTest, SetInfoRenamesLocallyAndChangesSizesLocally) {
   ASSERT_EQ(Open(Root, At("old.txt"), &File, kRead), EFI_SUCCESS);
   Buffer = Info(File, gEfiFileInfoGuid, &Status);
   reinterpret_cast<EFI_FILE_INFO *>(Buffer.data())->FileSize = 99;
-  Quiet([&] { Status = File->SetInfo(File, &gEfiFileInfoGuid, Buffer.size(), Buffer.data()); });
-  EXPECT_EQ(Status, EFI_ACCESS_DENIED);
+  EXPECT_EQ(
+      Quiet([&] { return File->SetInfo(File, &gEfiFileInfoGuid, Buffer.size(), Buffer.data()); }),
+      EFI_ACCESS_DENIED);
   Close(File);
   Close(Root);
 }
@@ -640,9 +625,7 @@ TEST_F(NwVolumeSambaTest, DeleteIsLocalAndRefusesTheRootAndReadOnlyFiles) {
   EFI_FILE_PROTOCOL *Root = OpenRoot();
   EFI_FILE_PROTOCOL *File = nullptr;
   ASSERT_EQ(Open(Root, At("gone.txt"), &File, kReadWrite), EFI_SUCCESS);
-  EFI_STATUS Status;
-  Quiet([&] { Status = File->Delete(File); });
-  EXPECT_EQ(Status, EFI_SUCCESS);
+  EXPECT_EQ(Quiet([&] { return File->Delete(File); }), EFI_SUCCESS);
   EXPECT_TRUE(Exists("gone.txt")); // the removal is acknowledged, not sent
 
   ASSERT_EQ(Open(Root, At("locked.txt"), &File, kRead), EFI_SUCCESS);
@@ -651,13 +634,11 @@ TEST_F(NwVolumeSambaTest, DeleteIsLocalAndRefusesTheRootAndReadOnlyFiles) {
   ASSERT_EQ(InfoStatus, EFI_SUCCESS);
   EXPECT_NE(Val(reinterpret_cast<EFI_FILE_INFO *>(Locked.data())->Attribute) & EFI_FILE_READ_ONLY,
             0u);
-  Quiet([&] { Status = File->Delete(File); });
-  EXPECT_EQ(Status, EFI_WARN_DELETE_FAILURE);
+  EXPECT_EQ(Quiet([&] { return File->Delete(File); }), EFI_WARN_DELETE_FAILURE);
 
   EFI_FILE_PROTOCOL *Root2 = OpenRoot();
   UINT64 Handles = Volume->FileHandles.Count;
-  Quiet([&] { Status = Root2->Delete(Root2); });
-  EXPECT_EQ(Status, EFI_WARN_DELETE_FAILURE);
+  EXPECT_EQ(Quiet([&] { return Root2->Delete(Root2); }), EFI_WARN_DELETE_FAILURE);
   EXPECT_EQ(Val(Volume->FileHandles.Count), Handles - 1); // closed by the refusal
   Close(Root);
 }
@@ -669,20 +650,16 @@ TEST_F(NwVolumeSambaTest, DeleteThroughAnotherHandleInvalidatesThisOne) {
   ASSERT_EQ(Open(Root, At("shared.txt"), &One, kReadWrite), EFI_SUCCESS);
   ASSERT_EQ(Open(Root, At("shared.txt"), &Two, kReadWrite), EFI_SUCCESS);
   EXPECT_EQ(NwHandleOf(One)->OpenFile, NwHandleOf(Two)->OpenFile);
-  EFI_STATUS Status;
-  Quiet([&] { Status = One->Delete(One); });
-  EXPECT_EQ(Status, EFI_SUCCESS);
+  EXPECT_EQ(Quiet([&] { return One->Delete(One); }), EFI_SUCCESS);
   std::vector<UINT8> Buffer(64);
   UINTN Size = Buffer.size();
   EXPECT_EQ(Read(Two, &Size, Buffer.data()), EFI_NOT_FOUND);
   EXPECT_EQ(Write(Two, {'x'}, &Size), EFI_NOT_FOUND);
   Size = Buffer.size();
-  Quiet([&] { Status = Two->GetInfo(Two, &gEfiFileInfoGuid, &Size, Buffer.data()); });
-  EXPECT_EQ(Status, EFI_NOT_FOUND);
-  Quiet([&] { Status = Two->Delete(Two); });
-  EXPECT_EQ(Status, EFI_NOT_FOUND);
-  Quiet([&] { Status = Two->Close(Two); });
-  EXPECT_EQ(Status, EFI_SUCCESS);
+  EXPECT_EQ(Quiet([&] { return Two->GetInfo(Two, &gEfiFileInfoGuid, &Size, Buffer.data()); }),
+            EFI_NOT_FOUND);
+  EXPECT_EQ(Quiet([&] { return Two->Delete(Two); }), EFI_NOT_FOUND);
+  EXPECT_EQ(Quiet([&] { return Two->Close(Two); }), EFI_SUCCESS);
   Close(Root);
 }
 
@@ -695,7 +672,7 @@ TEST_F(NwVolumeSambaTest, ShellCopiesToRamfsAndBackByteIdentical) {
   std::u16string Drive = MapVolume();
   ASSERT_FALSE(Drive.empty());
   Shell(u"cp -q " + Drive + At("src.bin") + u" ramfs:\\copy.bin");
-  EXPECT_TRUE(RamfsFile("copy.bin") == Data);
+  EXPECT_TRUE(ReadBytes(RamfsDir + "/copy.bin") == Data);
   Shell(u"cp -q ramfs:\\copy.bin " + Drive + At("back.bin"));
   EXPECT_TRUE(GetFile("back.bin") == Data);
   // TearDown unmounts and checks that the pool is back where it started.

@@ -52,15 +52,6 @@ Bytes Le(uint64_t Value, size_t Width) {
   }
   return Out;
 }
-void PutLe16(Bytes &Out, uint16_t Value) {
-  Out = Concat({Out, Le(Value, 2)});
-}
-void PutLe32(Bytes &Out, uint32_t Value) {
-  Out = Concat({Out, Le(Value, 4)});
-}
-void PutLe64(Bytes &Out, uint64_t Value) {
-  Out = Concat({Out, Le(Value, 8)});
-}
 void SetLe16(Bytes &Out, size_t At, uint16_t Value) {
   Out.at(At) = static_cast<uint8_t>(Value);
   Out.at(At + 1) = static_cast<uint8_t>(Value >> 8);
@@ -289,8 +280,9 @@ Server &Server::DrainUntilClosed() {
   return *this;
 }
 
-Server &Server::ScriptConnect(uint16_t Dialect, const ChallengeShape &Shape) {
-  ExpectRequest().Send(NegotiateResponse(Dialect));
+Server &Server::ScriptConnect(uint16_t Dialect, const ChallengeShape &Shape,
+                              uint32_t Capabilities) {
+  ExpectRequest().Send(NegotiateResponse(Dialect, 1, Capabilities));
   ExpectRequest().Send(SessionSetupResponse(0xC0000016, 1, kSessionId, Challenge(Shape)));
   ExpectRequest().Send(SessionSetupResponse(0, 2, kSessionId, {}));
   ExpectRequest().Send(TreeConnectResponse(3, kSessionId, kTreeId));
@@ -337,9 +329,7 @@ bool Server::ReadRequest(int Fd, Bytes &Out) {
   if (!ReadAll(Fd, Prefix, sizeof(Prefix))) {
     return false;
   }
-  uint32_t Length = static_cast<uint32_t>(Prefix[0]) << 24 |
-                    static_cast<uint32_t>(Prefix[1]) << 16 | static_cast<uint32_t>(Prefix[2]) << 8 |
-                    Prefix[3];
+  uint32_t Length = StreamLength(Bytes(Prefix, Prefix + 4));
   if (Length > (1u << 24)) {
     return false;
   }

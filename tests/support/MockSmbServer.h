@@ -23,11 +23,8 @@ using Bytes = std::vector<uint8_t>;
 // ---------------------------------------------------------------------------
 // Byte builders
 // ---------------------------------------------------------------------------
-// Value as Width little-endian bytes, and appended to Out.
+// Value as Width little-endian bytes.
 Bytes Le(uint64_t Value, size_t Width);
-void PutLe16(Bytes &Out, uint16_t Value);
-void PutLe32(Bytes &Out, uint32_t Value);
-void PutLe64(Bytes &Out, uint64_t Value);
 void SetLe16(Bytes &Out, size_t At, uint16_t Value);
 uint16_t GetLe16(const Bytes &In, size_t At);
 uint32_t GetLe32(const Bytes &In, size_t At);
@@ -118,7 +115,8 @@ public:
 
   // The standard answers of a successful connect for a dialect, up to and
   // including the tree connect (message ids 0 to 3).
-  Server &ScriptConnect(uint16_t Dialect, const ChallengeShape &Shape = ChallengeShape());
+  Server &ScriptConnect(uint16_t Dialect, const ChallengeShape &Shape = ChallengeShape(),
+                        uint32_t Capabilities = 6);
   // The answers of a disconnect after a tree connect (ids 4 and 5).
   Server &ScriptDisconnect();
 

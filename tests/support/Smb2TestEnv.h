@@ -82,11 +82,6 @@ protected:
 
 private:
   EFI_STATUS Run(EFI_STATUS (*Call)(SMB2ConnectInfo *, SMB2ShareDetails *), std::string *Out) {
-    EFI_STATUS Status = EFI_SUCCESS;
-    std::string Text = Console([&] { Status = Call(&Info, &Share); });
-    if (Out != nullptr) {
-      *Out = Text;
-    }
-    return Status;
+    return Captured(Out, [&] { return Call(&Info, &Share); });
   }
 };

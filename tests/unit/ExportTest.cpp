@@ -22,13 +22,8 @@ class ExportTest : public ShareTaskTest {
 protected:
   EFI_STATUS Export(const CHAR16 *SourceType, const CHAR16 *FileName = nullptr,
                     UINT32 ShareType = NWFS_SHARE_TYPE_CIFS, std::string *Out = nullptr) {
-    EFI_STATUS Status = EFI_SUCCESS;
-    std::string Text =
-        Console([&] { Status = ExporttoNWShare(ShareType, FileName, u"Export", SourceType); });
-    if (Out != nullptr) {
-      *Out = Text;
-    }
-    return Status;
+    return Captured(Out,
+                    [&] { return ExporttoNWShare(ShareType, FileName, u"Export", SourceType); });
   }
 
   // Names of the files in a directory of the share.

@@ -1,7 +1,7 @@
 // The hosted UEFI environment seen through its tables, the way the image sees
 // it: the counted pool, events and timers under TPL rules, the handle
 // database and driver model, the variable store file and Unicode Collation.
-#include "HostUefi.h"
+#include "HostImageFixture.h"
 
 #include <gtest/gtest.h>
 
@@ -10,7 +10,6 @@
 
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 #include <string>
 #include <vector>
 
@@ -23,35 +22,17 @@ const EFI_GUID kGuidB = {
 const EFI_GUID kProvisioningGuid = {
     0x4C4AC96B, 0xDD0A, 0x447E, {0x81, 0x18, 0x10, 0x59, 0x00, 0xDA, 0x86, 0x29}};
 
-class HostEnv : public ::testing::Test {
+class HostEnv : public HostImageTest {
 protected:
   void SetUp() override {
-    char Template[] = "/tmp/hostenv-XXXXXX";
-    ASSERT_NE(mkdtemp(Template), nullptr);
-    Dir = Template;
-    StorePath = Dir + "/vars.txt";
-    RamfsPath = Dir + "/ramfs";
-    HostConfig Config;
-    Config.RamfsDir = RamfsPath.c_str();
-    Config.VarStore = StorePath.c_str();
-    St = HostInitialize(Config);
-    ASSERT_NE(St, nullptr);
-    Bs = St->BootServices;
-    Rt = St->RuntimeServices;
-  }
-  void TearDown() override {
-    HostShutdown();
-    std::filesystem::remove_all(Dir);
+    HostImageTest::SetUp();
+    St = gST;
+    Bs = gBS;
+    Rt = gRT;
   }
 
-  std::string ReadStore() {
-    std::ifstream In(StorePath);
-    std::stringstream Text;
-    Text << In.rdbuf();
-    return Text.str();
-  }
+  std::string ReadStore() { return ReadFile(VarStore); }
 
-  std::string Dir, StorePath, RamfsPath;
   EFI_SYSTEM_TABLE *St = nullptr;
   EFI_BOOT_SERVICES *Bs = nullptr;
   EFI_RUNTIME_SERVICES *Rt = nullptr;
@@ -356,7 +337,7 @@ TEST_F(HostEnv, VariablesRoundTripThroughTheStoreFile) {
 
   // Edit the file behind the environment's back and reload.
   {
-    std::ofstream Out(StorePath, std::ios::app);
+    std::ofstream Out(VarStore, std::ios::app);
     Out << "# a comment\n\nnot a variable line\n"
         << "{11111111-2222-3333-4444-555555555552} Seeded 7 0102\n";
   }
@@ -375,8 +356,8 @@ TEST_F(HostEnv, VariablesRoundTripThroughTheStoreFile) {
   // A fresh environment on the same file sees the same store.
   HostShutdown();
   HostConfig Config;
-  Config.RamfsDir = RamfsPath.c_str();
-  Config.VarStore = StorePath.c_str();
+  Config.RamfsDir = RamfsDir.c_str();
+  Config.VarStore = VarStore.c_str();
   St = HostInitialize(Config);
   Rt = St->RuntimeServices;
   Size = sizeof Buffer;

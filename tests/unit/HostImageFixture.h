@@ -11,9 +11,12 @@
 
 #include <stdlib.h>
 
+#include <algorithm>
 #include <filesystem>
+#include <fstream>
 #include <functional>
 #include <string>
+#include <type_traits>
 #include <vector>
 
 class HostImageTest : public ::testing::Test {
@@ -52,6 +55,29 @@ protected:
     return HostConsoleCaptureEnd();
   }
 
+  // Runs Call with the console captured and dropped; returns what Call does.
+  template <typename F>
+  static auto Quiet(F Call) {
+    if constexpr (std::is_void_v<decltype(Call())>) {
+      Console(Call);
+    } else {
+      decltype(Call()) Result{};
+      Console([&] { Result = Call(); });
+      return Result;
+    }
+  }
+
+  // Like Quiet, and keeps what was printed in *Out when Out is given.
+  template <typename F>
+  static auto Captured(std::string *Out, F Call) {
+    decltype(Call()) Result{};
+    std::string Text = Console([&] { Result = Call(); });
+    if (Out != nullptr) {
+      *Out = Text;
+    }
+    return Result;
+  }
+
   // Runs the image with a command line (argument 0 included).
   static EFI_STATUS RunImage(std::vector<std::string> Args, std::string *Output = nullptr) {
     std::vector<char *> Argv;
@@ -59,13 +85,8 @@ protected:
       Argv.push_back(Arg.data());
     }
     Argv.push_back(nullptr);
-    EFI_STATUS Status = EFI_SUCCESS;
-    std::string Text =
-        Console([&] { Status = HostRunImage(static_cast<int>(Args.size()), Argv.data()); });
-    if (Output != nullptr) {
-      *Output = Text;
-    }
-    return Status;
+    return Captured(Output,
+                    [&] { return HostRunImage(static_cast<int>(Args.size()), Argv.data()); });
   }
 
   struct Variable {
@@ -88,6 +109,31 @@ protected:
   static EFI_STATUS WriteVar(const CHAR16 *Name, const EFI_GUID &Guid, UINT32 Attributes,
                              const std::vector<UINT8> &Data) {
     return gRT->SetVariable(Name, &Guid, Attributes, Data.size(), Data.data());
+  }
+
+  // Whole host files as bytes in a string; writing makes the parents.
+  static std::string ReadFile(const std::string &Path) {
+    std::ifstream In(Path, std::ios::binary);
+    return std::string(std::istreambuf_iterator<char>(In), {});
+  }
+  static std::vector<UINT8> ReadBytes(const std::string &Path) {
+    std::string Text = ReadFile(Path);
+    return {Text.begin(), Text.end()};
+  }
+  static void WriteFile(const std::string &Path, const std::string &Text) {
+    std::filesystem::create_directories(std::filesystem::path(Path).parent_path());
+    std::ofstream(Path, std::ios::binary) << Text;
+  }
+
+  // A file information record with the fixed part of Base (zeros when Base
+  // is empty) and Name; its Size field says how long it is.
+  static std::vector<UINT8> NamedInfo(const std::vector<UINT8> &Base, const std::u16string &Name) {
+    std::vector<UINT8> Out(SIZE_OF_EFI_FILE_INFO + 2 * (Name.size() + 1));
+    std::copy_n(Base.begin(), std::min<size_t>(Base.size(), SIZE_OF_EFI_FILE_INFO), Out.begin());
+    std::copy(Name.begin(), Name.end(),
+              reinterpret_cast<CHAR16 *>(Out.data() + SIZE_OF_EFI_FILE_INFO));
+    reinterpret_cast<EFI_FILE_INFO *>(Out.data())->Size = Out.size();
+    return Out;
   }
 
   static size_t Count(const std::string &Text, const std::string &Piece) {

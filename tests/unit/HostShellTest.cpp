@@ -5,9 +5,7 @@
 #include "HostInternal.h"
 
 #include <cstring>
-#include <fstream>
 #include <memory>
-#include <sstream>
 
 namespace {
 
@@ -178,18 +176,12 @@ protected:
     return Root;
   }
 
-  std::string HostFile(const std::string &Name) {
-    std::ifstream In(RamfsDir + "/" + Name, std::ios::binary);
-    std::stringstream Text;
-    Text << In.rdbuf();
-    return Text.str();
-  }
+  std::string HostFile(const std::string &Name) { return ReadFile(RamfsDir + "/" + Name); }
   bool HostExists(const std::string &Name) {
     return std::filesystem::exists(RamfsDir + "/" + Name);
   }
   void PutHostFile(const std::string &Name, const std::string &Data) {
-    std::filesystem::create_directories(std::filesystem::path(RamfsDir + "/" + Name).parent_path());
-    std::ofstream(RamfsDir + "/" + Name, std::ios::binary) << Data;
+    WriteFile(RamfsDir + "/" + Name, Data);
   }
 
   // Installs the recording volume in front of the RAM disk.
@@ -288,10 +280,7 @@ TEST_F(HostShellTest, RamfsFilesFollowFirmwareSemantics) {
   EXPECT_EQ(File->SetInfo(File, &gEfiFileInfoGuid, Changed.size(), Changed.data()), EFI_SUCCESS);
   EXPECT_EQ(HostFile("Logs/Report.TXT"), "hello");
   std::u16string NewName = u"Moved.txt";
-  Changed.assign(SIZE_OF_EFI_FILE_INFO + (NewName.size() + 1) * sizeof(CHAR16), 0);
-  std::memcpy(Changed.data(), Fi.data(), SIZE_OF_EFI_FILE_INFO);
-  std::memcpy(Changed.data() + SIZE_OF_EFI_FILE_INFO, NewName.c_str(), (NewName.size() + 1) * 2);
-  reinterpret_cast<EFI_FILE_INFO *>(Changed.data())->Size = Changed.size();
+  Changed = NamedInfo(Fi, NewName);
   reinterpret_cast<EFI_FILE_INFO *>(Changed.data())->FileSize = 5;
   EXPECT_EQ(File->SetInfo(File, &gEfiFileInfoGuid, Changed.size(), Changed.data()), EFI_SUCCESS);
   EXPECT_TRUE(HostExists("Logs/Moved.txt"));

@@ -62,21 +62,14 @@ protected:
   }
 
   EFI_STATUS Mount(const CHAR16 *ShareName, std::string *Out = nullptr) {
-    EFI_STATUS Status = EFI_SUCCESS;
-    std::string Text = Console([&] {
-      Status = MountStaticFileSystem(ShareName, u"127.0.0.1", NWFS_SHARE_TYPE_CIFS, u"cifstest",
-                                     u"secret");
+    return Captured(Out, [&] {
+      return MountStaticFileSystem(ShareName, u"127.0.0.1", NWFS_SHARE_TYPE_CIFS, u"cifstest",
+                                   u"secret");
     });
-    if (Out != nullptr) {
-      *Out = Text;
-    }
-    return Status;
   }
 
   EFI_STATUS Unmount() {
-    EFI_STATUS Status = EFI_SUCCESS;
-    Console([&] { Status = UnmountStaticFileSystem(u"share", u"127.0.0.1"); });
-    return Status;
+    return Quiet([&] { return UnmountStaticFileSystem(u"share", u"127.0.0.1"); });
   }
 
   void ExpectNothingLeft() {

@@ -202,16 +202,6 @@ protected:
     HostImageTest::TearDown();
   }
 
-  static void WriteFile(const std::string &Path, const std::string &Text) {
-    std::filesystem::create_directories(std::filesystem::path(Path).parent_path());
-    std::ofstream(Path, std::ios::binary) << Text;
-  }
-
-  static std::string ReadFile(const std::string &Path) {
-    std::ifstream In(Path, std::ios::binary);
-    return std::string(std::istreambuf_iterator<char>(In), {});
-  }
-
   // The text-field record the catalog tasks persist into, as other firmware
   // components would have created it.
   static void SeedTextFields(const std::string &CifsCatalogPath = "") {

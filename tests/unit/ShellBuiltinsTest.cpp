@@ -49,9 +49,7 @@ protected:
   }
 
   static EFI_STATUS Run(const CHAR16 *Line) {
-    EFI_STATUS Status = EFI_SUCCESS;
-    Console([&] { Status = RunSystemCommandW(Line); });
-    return Status;
+    return Quiet([&] { return RunSystemCommandW(Line); });
   }
 
   static std::string Bytes(size_t Count, unsigned Seed) {
@@ -61,15 +59,6 @@ protected:
       C = static_cast<char>(Random());
     }
     return Text;
-  }
-
-  static void Write(const std::string &Path, const std::string &Text) {
-    std::ofstream(Path, std::ios::binary) << Text;
-  }
-
-  static std::string Read(const std::string &Path) {
-    std::ifstream In(Path, std::ios::binary);
-    return std::string(std::istreambuf_iterator<char>(In), {});
   }
 
   ShareStandIn Share;
@@ -102,26 +91,26 @@ TEST_F(ShellBuiltinsTest, MappingsAreMadeInTheCallingShell) {
 TEST_F(ShellBuiltinsTest, CopiesAreByteIdenticalAcrossVolumes) {
   // Several copy chunks and a partial one.
   const std::string Content = Bytes(300 * 1024 + 17, 7);
-  Write(ShareDir + "/catalog/big.bin", Content);
+  WriteFile(ShareDir + "/catalog/big.bin", Content);
 
   // A destination ending in '\' gets the source's name.
   EXPECT_EQ(Run(u"cp -q CIFS:\\catalog\\big.bin ramfs:\\"), EFI_SUCCESS);
-  EXPECT_EQ(Read(RamfsDir + "/big.bin"), Content);
+  EXPECT_EQ(ReadFile(RamfsDir + "/big.bin"), Content);
 
   // An existing directory as destination does too; a longer existing file is
   // replaced, not overwritten in place.
-  Write(ShareDir + "/catalog/back.bin", Bytes(400 * 1024, 9));
+  WriteFile(ShareDir + "/catalog/back.bin", Bytes(400 * 1024, 9));
   EXPECT_EQ(Run(u"cp -q ramfs:\\big.bin CIFS:\\catalog\\back.bin"), EFI_SUCCESS);
-  EXPECT_EQ(Read(ShareDir + "/catalog/back.bin"), Content);
+  EXPECT_EQ(ReadFile(ShareDir + "/catalog/back.bin"), Content);
   fs::create_directories(RamfsDir + "/into");
   EXPECT_EQ(Run(u"cp CIFS:\\catalog\\back.bin ramfs:\\into"), EFI_SUCCESS);
-  EXPECT_EQ(Read(RamfsDir + "/into/back.bin"), Content);
+  EXPECT_EQ(ReadFile(RamfsDir + "/into/back.bin"), Content);
 
   // With a redirection the target receives a UCS-2 account of the copy.
-  Write(RamfsDir + "/DGRLog.txt", std::string(4096, 'x'));
+  WriteFile(RamfsDir + "/DGRLog.txt", std::string(4096, 'x'));
   EXPECT_EQ(Run(u"cp -q ramfs:\\big.bin CIFS:\\log.bin > ramfs:\\DGRLog.txt"), EFI_SUCCESS);
-  EXPECT_EQ(Read(ShareDir + "/log.bin"), Content);
-  std::string Log = Read(RamfsDir + "/DGRLog.txt");
+  EXPECT_EQ(ReadFile(ShareDir + "/log.bin"), Content);
+  std::string Log = ReadFile(RamfsDir + "/DGRLog.txt");
   ASSERT_GE(Log.size(), 4u);
   EXPECT_EQ(Log.substr(0, 2), std::string("\xFF\xFE", 2));
   EXPECT_LT(Log.size(), 4096u);
@@ -136,7 +125,7 @@ TEST_F(ShellBuiltinsTest, FailedCopiesAndDeletesReportTheirStatus) {
   EXPECT_TRUE(EFI_ERROR(Run(u"cp -q CIFS:\\catalog ramfs:\\")));
   EXPECT_FALSE(fs::exists(RamfsDir + "/catalog"));
 
-  Write(RamfsDir + "/old.txt", "old");
+  WriteFile(RamfsDir + "/old.txt", "old");
   EXPECT_EQ(Run(u"del -q ramfs:\\old.txt"), EFI_SUCCESS);
   EXPECT_FALSE(fs::exists(RamfsDir + "/old.txt"));
   EXPECT_TRUE(EFI_ERROR(Run(u"del -q ramfs:\\old.txt")));
@@ -153,7 +142,7 @@ TEST_F(ShellBuiltinsTest, OtherCommandsAndNonNestingShellsUseExecute) {
   // A shell that runs commands in place ("nonesting" is "True", in any case)
   // gets every command through Execute.
   ASSERT_EQ(gWrappedShell->SetEnv(u"nonesting", u"TRUE", TRUE), EFI_SUCCESS);
-  Write(RamfsDir + "/old.txt", "old");
+  WriteFile(RamfsDir + "/old.txt", "old");
   EXPECT_EQ(Run(u"del -q ramfs:\\old.txt"), EFI_SUCCESS);
   EXPECT_FALSE(fs::exists(RamfsDir + "/old.txt"));
   EXPECT_EQ(gExecuteCalls, 4);

@@ -31,9 +31,7 @@ protected:
   }
 
   EFI_STATUS CloseFile(NW_REMOTE_FILE *File) {
-    EFI_STATUS Status = EFI_SUCCESS;
-    Console([&] { Status = GEE_NWFClose(&Share, File); });
-    return Status;
+    return Quiet([&] { return GEE_NWFClose(&Share, File); });
   }
 };
 
@@ -270,9 +268,7 @@ TEST_F(Smb2FileOpsHostileTest, AnswersTooShortForTheirFixedPart) {
   ScriptConnect();
   Expect([](uint64_t Id) { return CreateAnswer(Id); });
   // A READ answer of 4 body bytes.
-  Expect([](uint64_t Id) {
-    return MockSmb::Frame(MockSmb::Concat({HeaderFor(8, Id), Bytes{17, 0, 0x50, 0}}));
-  });
+  Expect([](uint64_t Id) { return AnswerTo(8, Id, {Bytes{17, 0, 0x50, 0}}); });
   Expect([](uint64_t Id) { return CloseAnswer(Id); });
   ScriptDisconnect();
   Connect();

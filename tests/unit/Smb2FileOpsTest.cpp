@@ -182,12 +182,7 @@ TEST_F(Smb2FileRequestTest, InformationAnswersLandInTheirOwnFields) {
   EXPECT_EQ(Verify(1, 8, Bytes(3, 1)), EFI_PROTOCOL_ERROR);
   EXPECT_EQ(CompareMem(&Before, &Access, sizeof(Access)), 0);
 
-  Bytes Fs;
-  Put(Fs, 8, 1000);
-  Put(Fs, 8, 250);
-  Put(Fs, 4, 16);
-  Put(Fs, 4, 512);
-  ASSERT_EQ(Verify(2, 3, Fs), EFI_SUCCESS);
+  ASSERT_EQ(Verify(2, 3, Concat({Le(1000, 8), Le(250, 8), Le(16, 4), Le(512, 4)})), EFI_SUCCESS);
   EXPECT_EQ(+Access.FsSize.TotalAllocationUnits, 1000u);
   EXPECT_EQ(+Access.FsSize.AvailableAllocationUnits, 250u);
   EXPECT_EQ(+Access.FsSize.SectorsPerAllocationUnit, 16u);

@@ -18,12 +18,8 @@ namespace FileScript {
 
 using MockSmb::Bytes;
 
-// Value appended as Width little-endian bytes.
-inline void Put(Bytes &Out, size_t Width, uint64_t Value) {
-  for (size_t I = 0; I < Width; I++) {
-    Out.push_back(static_cast<uint8_t>(Value >> (8 * I)));
-  }
-}
+using MockSmb::Concat;
+using MockSmb::Le;
 
 inline uint64_t MessageIdOf(const Bytes &Request) {
   return MockSmb::GetLe64(Request, 4 + 24);
@@ -32,100 +28,67 @@ inline uint16_t CommandOf(const Bytes &Request) {
   return MockSmb::GetLe16(Request, 4 + 12);
 }
 
-inline Bytes HeaderFor(uint16_t Command, uint64_t MessageId, uint32_t Status = 0) {
-  MockSmb::HeaderFields Fields;
-  Fields.Command = Command;
-  Fields.Status = Status;
-  Fields.MessageId = MessageId;
-  Fields.SessionId = MockSmb::kSessionId;
-  Fields.TreeId = MockSmb::kTreeId;
-  return MockSmb::Header(Fields);
+// A framed answer to Command: the header, then the parts.
+inline Bytes AnswerTo(uint16_t Command, uint64_t MessageId, std::initializer_list<Bytes> Parts,
+                      uint32_t Status = 0) {
+  Bytes Header =
+      MockSmb::Header({Command, Status, MessageId, MockSmb::kSessionId, MockSmb::kTreeId, 1, 1});
+  return MockSmb::Frame(Concat({Header, Concat(Parts)}));
+}
+
+// A length field: Announced when given, else the size of what it describes.
+inline Bytes Announce(int64_t Announced, size_t Actual) {
+  return Le(Announced < 0 ? Actual : static_cast<uint32_t>(Announced), 4);
+}
+
+// Four FILETIMEs starting at Base (created, accessed, written, changed).
+inline Bytes Times(uint64_t Base, uint64_t Step) {
+  return Concat({Le(Base, 8), Le(Base + Step, 8), Le(Base + 2 * Step, 8), Le(Base + 3 * Step, 8)});
 }
 
 constexpr uint8_t kFileId[16] = {1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 13, 14, 15, 16};
 
-// A CREATE answer; ContextsLength is announced, Tail follows the body.
+// A CREATE answer (opened, oplock none); ContextsLength is announced, Tail
+// follows the body.
 inline Bytes CreateAnswer(uint64_t MessageId, const uint8_t *FileId = kFileId,
                           uint32_t ContextsLength = 0, const Bytes &Tail = {}) {
-  Bytes Body;
-  Put(Body, 2, 89);
-  Body.push_back(0); // oplock
-  Body.push_back(0);
-  Put(Body, 4, 1); // opened
-  for (int I = 0; I < 4; I++) {
-    Put(Body, 8, 0x01D0000000000000ULL + I);
-  }
-  Put(Body, 8, 4096);
-  Put(Body, 8, 100);
-  Put(Body, 4, 0x20);
-  Put(Body, 4, 0);
-  Body.insert(Body.end(), FileId, FileId + 16);
-  Put(Body, 4, ContextsLength == 0 ? 0 : 152);
-  Put(Body, 4, ContextsLength);
-  return MockSmb::Frame(MockSmb::Concat({HeaderFor(5, MessageId), Body, Tail}));
+  return AnswerTo(5, MessageId,
+                  {Le(89, 2), Le(0, 2), Le(1, 4), Times(0x01D0000000000000ULL, 1), Le(4096, 8),
+                   Le(100, 8), Le(0x20, 4), Le(0, 4), Bytes(FileId, FileId + 16),
+                   Le(ContextsLength == 0 ? 0 : 152, 4), Le(ContextsLength, 4), Tail});
 }
 
 inline Bytes CloseAnswer(uint64_t MessageId) {
-  Bytes Body;
-  Put(Body, 2, 60);
-  Body.resize(60, 0);
-  return MockSmb::Frame(MockSmb::Concat({HeaderFor(6, MessageId), Body}));
+  return AnswerTo(6, MessageId, {Le(60, 2), Bytes(58, 0)});
 }
 
 // A READ answer carrying Data; DataLength announces Announced bytes (the
 // data's size unless given).
 inline Bytes ReadAnswer(uint64_t MessageId, const Bytes &Data, int64_t Announced = -1) {
-  Bytes Body;
-  Put(Body, 2, 17);
-  Body.push_back(0x50);
-  Body.push_back(0);
-  Put(Body, 4,
-      Announced < 0 ? static_cast<uint32_t>(Data.size()) : static_cast<uint32_t>(Announced));
-  Put(Body, 4, 0);
-  Put(Body, 4, 0);
-  return MockSmb::Frame(MockSmb::Concat({HeaderFor(8, MessageId), Body, Data}));
+  return AnswerTo(8, MessageId,
+                  {Le(17, 2), {0x50, 0}, Announce(Announced, Data.size()), Le(0, 8), Data});
 }
 
 inline Bytes WriteAnswer(uint64_t MessageId, uint32_t Count) {
-  Bytes Body;
-  Put(Body, 2, 17);
-  Put(Body, 2, 0);
-  Put(Body, 4, Count);
-  Put(Body, 4, 0);
-  Put(Body, 4, 0);
-  return MockSmb::Frame(MockSmb::Concat({HeaderFor(9, MessageId), Body}));
+  return AnswerTo(9, MessageId, {Le(17, 2), Le(0, 2), Le(Count, 4), Le(0, 8)});
 }
 
 // A QUERY_INFO (16) or QUERY_DIRECTORY (14) answer with Output;
 // OutputBufferLength announces Announced bytes unless -1.
 inline Bytes QueryAnswer(uint16_t Command, uint64_t MessageId, const Bytes &Output,
                          int64_t Announced = -1) {
-  Bytes Body;
-  Put(Body, 2, 9);
-  Put(Body, 2, 72);
-  Put(Body, 4,
-      Announced < 0 ? static_cast<uint32_t>(Output.size()) : static_cast<uint32_t>(Announced));
-  return MockSmb::Frame(MockSmb::Concat({HeaderFor(Command, MessageId), Body, Output}));
+  return AnswerTo(Command, MessageId,
+                  {Le(9, 2), Le(72, 2), Announce(Announced, Output.size()), Output});
 }
 
 // One FileFullDirectoryInformation entry; NameLength announces the name's
 // byte count unless given.
 inline Bytes DirEntry(const std::string &Name, uint32_t Next, uint64_t Size = 0,
                       uint32_t Attributes = 0x20, int64_t NameLength = -1) {
-  Bytes Entry;
-  Put(Entry, 4, Next);
-  Put(Entry, 4, 0);
-  for (int I = 0; I < 4; I++) {
-    Put(Entry, 8, 0x01D0000000000000ULL);
-  }
-  Put(Entry, 8, Size);
-  Put(Entry, 8, (Size + 4095) / 4096 * 4096);
-  Put(Entry, 4, Attributes);
   Bytes Utf = MockSmb::Utf16(Name);
-  MockSmb::PutLe32(Entry, NameLength < 0 ? static_cast<uint32_t>(Utf.size())
-                                         : static_cast<uint32_t>(NameLength));
-  Put(Entry, 4, 0);
-  Entry.insert(Entry.end(), Utf.begin(), Utf.end());
+  Bytes Entry = Concat({Le(Next, 4), Le(0, 4), Times(0x01D0000000000000ULL, 0), Le(Size, 8),
+                        Le((Size + 4095) / 4096 * 4096, 8), Le(Attributes, 4),
+                        Announce(NameLength, Utf.size()), Le(0, 4), Utf});
   // Padded up to the next entry when that is near.
   if (Next > Entry.size() && Next <= 1024) {
     Entry.resize(Next, 0);
@@ -158,12 +121,7 @@ protected:
 
   // The answers of a connect on Dialect by a server with Capabilities.
   void ScriptConnect(uint16_t Dialect = 0x0210, uint32_t Capabilities = 6) {
-    Server.ExpectRequest().Send(MockSmb::NegotiateResponse(Dialect, 1, Capabilities));
-    Server.ExpectRequest().Send(MockSmb::SessionSetupResponse(
-        0xC0000016, 1, MockSmb::kSessionId, MockSmb::Challenge(MockSmb::ChallengeShape())));
-    Server.ExpectRequest().Send(MockSmb::SessionSetupResponse(0, 2, MockSmb::kSessionId, {}));
-    Server.ExpectRequest().Send(
-        MockSmb::TreeConnectResponse(3, MockSmb::kSessionId, MockSmb::kTreeId));
+    Server.ScriptConnect(Dialect, MockSmb::ChallengeShape(), Capabilities);
   }
 
   // Reads one request and sends what Reply builds for its message id.
@@ -206,12 +164,7 @@ protected:
     Names.push_back(Name);
     ZeroMem(File, sizeof(*File));
     File->FileName = Names.back().data();
-    EFI_STATUS Status = EFI_SUCCESS;
-    std::string Text = Console([&] { Status = GEE_NWFOpen(&Share, File, EFI_FILE_MODE_READ, 2); });
-    if (Out != nullptr) {
-      *Out = Text;
-    }
-    return Status;
+    return Captured(Out, [&] { return GEE_NWFOpen(&Share, File, EFI_FILE_MODE_READ, 2); });
   }
 
   // The requests the server received after the connect (ids 0 to 3).

@@ -16,23 +16,12 @@ namespace fs = std::filesystem;
 class TasksTest : public ShareTaskTest {
 protected:
   EFI_STATUS Catalog(const CHAR16 *Directory, std::string *Out = nullptr) {
-    EFI_STATUS Status = EFI_SUCCESS;
-    std::string Text =
-        Console([&] { Status = GetCatalogFromNwFS(NWFS_SHARE_TYPE_CIFS, Directory, FALSE); });
-    if (Out != nullptr) {
-      *Out = Text;
-    }
-    return Status;
+    return Captured(Out,
+                    [&] { return GetCatalogFromNwFS(NWFS_SHARE_TYPE_CIFS, Directory, FALSE); });
   }
 
   EFI_STATUS Import(const CHAR16 *Path, std::string *Out = nullptr) {
-    EFI_STATUS Status = EFI_SUCCESS;
-    std::string Text =
-        Console([&] { Status = GetFileFromNWFS(NWFS_SHARE_TYPE_CIFS, Path, u"ramfs:\\"); });
-    if (Out != nullptr) {
-      *Out = Text;
-    }
-    return Status;
+    return Captured(Out, [&] { return GetFileFromNWFS(NWFS_SHARE_TYPE_CIFS, Path, u"ramfs:\\"); });
   }
 };
 
@@ -172,17 +161,13 @@ TEST_F(TasksTest, ImportOfAMissingFileReportsTheCopyFailure) {
 
 TEST_F(TasksTest, SignatureMissingOnTheShareIsReported) {
   SeedTextFields("CIFS:\\repository");
-  EFI_STATUS Status = EFI_SUCCESS;
-  Console([&] { Status = CopyCatalogSignatureToRamfs(); });
-  EXPECT_EQ(Status, EFI_NOT_FOUND);
+  EXPECT_EQ(Quiet([&] { return CopyCatalogSignatureToRamfs(); }), EFI_NOT_FOUND);
   ExpectNoPoolLeak();
 }
 
 TEST_F(TasksTest, SignatureWithoutTextFieldRecordDoesNothing) {
   WriteFile(ShareDir + "/catalog.xml.gz.sign", "signature");
-  EFI_STATUS Status = EFI_NOT_FOUND;
-  Console([&] { Status = CopyCatalogSignatureToRamfs(); });
-  EXPECT_EQ(Status, EFI_SUCCESS);
+  EXPECT_EQ(Quiet([&] { return CopyCatalogSignatureToRamfs(); }), EFI_SUCCESS);
   EXPECT_FALSE(fs::exists(RamfsDir + "/catalog.xml.gz.sign"));
   ExpectNoPoolLeak();
 }
