@@ -5,6 +5,9 @@
 #   e2e_run ARGS...            -> $E2E_OUT (console text), $E2E_RC (exit code)
 #   e2e_check DESCRIPTION CMD... (passes when CMD succeeds)
 #   e2e_finish                 -> prints "N passed, M failed", exits non-zero on failure
+#
+# With CIFSDRV_CONSOLE_LOG set, every run's arguments and console text are
+# appended to that file (for comparing consoles across changes).
 
 E2E_PASSED=0
 E2E_FAILED=0
@@ -30,6 +33,9 @@ e2e_reset_vars() {
 e2e_run() {
   E2E_OUT=$(timeout 60 "$E2E_BIN" "$@" 2>&1)
   E2E_RC=$?
+  if [[ -n "${CIFSDRV_CONSOLE_LOG:-}" ]]; then
+    printf '### %s %s\n%s\n' "$(basename "$0")" "$*" "$E2E_OUT" >>"$CIFSDRV_CONSOLE_LOG"
+  fi
 }
 
 e2e_check() {

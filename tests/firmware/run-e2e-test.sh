@@ -29,6 +29,7 @@
 #                       that instance instead of a nested one
 #   FW_E2E_DEBUG_LEVEL  driver debug level stored before the runs (0 to 5)
 #   FW_E2E_LIMIT        time limit of the first boot in seconds (150)
+#   FW_CONSOLE_DIR      a directory the two boots' console logs are copied to
 #
 # Exit status 0 when every check passes; otherwise the failed checks and the
 # path of the kept console log are printed.
@@ -336,6 +337,10 @@ boot second "$SECOND_LIMIT" "user,id=n0,restrict=on"
 
 FIRST="$WORK/console-first.txt"
 SECOND="$WORK/console-second.txt"
+if [ -n "${FW_CONSOLE_DIR:-}" ]; then
+  mkdir -p "$FW_CONSOLE_DIR"
+  cp "$FIRST" "$SECOND" "$FW_CONSOLE_DIR/"
+fi
 
 # step_time STAMPS NAME: seconds from the start of the step to the image's
 # return, empty when unknown.
