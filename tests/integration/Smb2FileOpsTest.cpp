@@ -477,23 +477,6 @@ TEST_F(FileOpsSambaTest, NfsShareTypeReachesTheSmb2Adapter) {
   EXPECT_STREQ(gSMB2ShareDetails.Sharename, "\\\\127.0.0.1\\cifsshare");
 }
 
-TEST_F(FileOpsSambaTest, SeveralRequestsInOneWriteTakeTheirSourceFromTheLastReadCount) {
-  StartAndConnect("SMB2_10");
-  const std::vector<UINT8> Data = Pattern(70000, 9);
-  NW_REMOTE_FILE File;
-  ASSERT_EQ(Open("twice.bin", kCreateReadWrite, &File), EFI_SUCCESS);
-  // Kept as designed: the second request's source is the buffer advanced by
-  // the last READ's count (here none), so the start of the buffer repeats.
-  gFileAccessDetails.ReadWriteInfo.BytesRead = 0;
-  UINTN Length = Data.size();
-  EXPECT_EQ(Write(&File, Data.data(), &Length, 0), EFI_SUCCESS);
-  EXPECT_EQ(Length, Data.size());
-  EXPECT_EQ(Close(&File), EFI_SUCCESS);
-  std::vector<UINT8> Expected(Data.begin(), Data.begin() + 64512);
-  Expected.insert(Expected.end(), Data.begin(), Data.begin() + (70000 - 64512));
-  EXPECT_TRUE(ReadBytes(Work + "/twice.bin") == Expected);
-}
-
 // Reads the share file named by CIFSDRV_BENCH_FILE five times (or
 // CIFSDRV_BENCH_ROUNDS) through GEE_NWFRead in 1 MiB calls, the volume's
 // largest, and prints each time and the median.

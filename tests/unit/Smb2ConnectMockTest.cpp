@@ -66,7 +66,7 @@ TEST_F(Smb2ConnectMockTest, ConnectAndDisconnectOnDialect210) {
   EXPECT_EQ(+TransactDetails.DialectRevision, 0x0210);
   EXPECT_EQ(+TransactDetails.SessionId, kSessionId);
   EXPECT_EQ(+TransactDetails.TreeId, kTreeId);
-  EXPECT_EQ(+TransactDetails.MessageId, 3u);
+  EXPECT_EQ(+TransactDetails.MessageId, 4u); // the tree connect's id was 3
   EXPECT_EQ(+TransactDetails.ServerCapabilities, 6u);
   EXPECT_STREQ(TransactDetails.ShareDetails.FormattedAddress, "127.0.0.1");
   EXPECT_EQ(SMB2ConnectionState, SMB2_STATE_TREE);

@@ -63,6 +63,10 @@ void AsciiStrToUnicodeS(const CHAR8 *Source, CHAR16 *Destination, UINTN DestMax)
 void UnicodeStrToAsciiS(const CHAR16 *Source, CHAR8 *Destination, UINTN DestMax);
 CHAR16 *AsciiStrDupToUnicode(const CHAR8 *Source); // pool, length + 1 characters
 CHAR8 *UnicodeStrDupToAscii(const CHAR16 *Source); // pool, length + 1 characters
+// 8-bit text in the "default" character set (Latin-1) to UTF-16LE bytes, the
+// conversion every name on the wire goes through. Writes at most Maximum
+// characters (no terminator) and returns the count written.
+UINTN strtoUTF16(void *Out, const CHAR8 *Text, UINTN Maximum, const CHAR8 *Codepage);
 
 // ---------------------------------------------------------------------------
 // Formatter

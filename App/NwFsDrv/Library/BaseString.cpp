@@ -229,3 +229,18 @@ CHAR16 *AsciiStrDupToUnicode(const CHAR8 *Source) {
 CHAR8 *UnicodeStrDupToAscii(const CHAR16 *Source) {
   return ConvertDuplicate<CHAR16, CHAR8, Narrow>(Source);
 }
+
+UINTN strtoUTF16(void *Out, const CHAR8 *Text, UINTN Maximum, const CHAR8 *Codepage) {
+  (void)Codepage; // "default" is the only character set: Latin-1, one byte per character
+  if (Out == nullptr || Text == nullptr) {
+    return 0;
+  }
+  UINT8 *Bytes = static_cast<UINT8 *>(Out);
+  UINTN Count = 0;
+  while (Count < Maximum && Text[Count] != '\0') {
+    Bytes[Count * 2] = static_cast<UINT8>(Text[Count]);
+    Bytes[Count * 2 + 1] = 0;
+    Count++;
+  }
+  return Count;
+}

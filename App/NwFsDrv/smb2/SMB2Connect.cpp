@@ -1,4 +1,7 @@
-// Connection orchestration: SMB2_Connect and SMB2_Disconnect.
+// Connection orchestration: SMB2_Connect and SMB2_Disconnect, and the steps
+// they run (negotiate, session setup, tree connect, tree disconnect,
+// logoff), each of which runs its commands through the exchange path and
+// reports their codes.
 //
 // Nothing is retried and nothing is undone when a connect fails: the socket
 // stays open (gSMB2SockFd set) for the disconnect to close, and a disconnect
@@ -33,7 +36,160 @@ void PrintMessageId(const CHAR8 *Function) {
           static_cast<INT64>(TransactDetails.MessageId));
 }
 
+void PrintNegotiated(const TRANSACT_DETAILS *Details) {
+  Smb2Log(DIAG_VERBOSE, "TransactDetails.DialectRevision = 0x%x\n", Details->DialectRevision);
+  Smb2Log(DIAG_VERBOSE, "TransactDetails.CreditRequest = 0x%x\n", Details->CreditRequest);
+  Smb2Log(DIAG_VERBOSE, "TransactDetails.MaxTransactSize = 0x%x\n", Details->MaxTransactSize);
+  Smb2Log(DIAG_VERBOSE, "TransactDetails.MaxReadSize = 0x%x\n", Details->MaxReadSize);
+  Smb2Log(DIAG_VERBOSE, "TransactDetails.MaxWriteSize = 0x%x\n", Details->MaxWriteSize);
+  Smb2Log(DIAG_VERBOSE, "TransactDetails.Flags = 0x%x\n", Details->Flags);
+  Smb2Log(DIAG_VERBOSE, "TransactDetails.SecurityMode = 0x%x\n", Details->SecurityMode);
+  Smb2Log(DIAG_VERBOSE, "TransactDetails.Capabilities = 0x%x\n", Details->Capabilities);
+  Smb2Log(DIAG_VERBOSE, "TransactDetails.Channel = 0x%x\n", Details->Channel);
+  Smb2Log(DIAG_VERBOSE, "TransactDetails.SecurityBufferLength = 0x%x\n",
+          Details->SecurityBufferLength);
+}
+
+void PrintChallenge(const SMB2_SESSION_SETUP_RESPONSE *Response,
+                    const SMB2_NTLM_CHALLENGE *Challenge) {
+  Smb2Log(DIAG_VERBOSE, "SessionSetupResp.Header.Status = 0x%x\n", Response->Header.Status);
+  Smb2Log(DIAG_VERBOSE, "SessionSetupResp.Header.CreditRequest = 0x%x\n",
+          Response->Header.CreditRequest);
+  Smb2Log(DIAG_VERBOSE, "SessionSetupResp.StrutureSize = 0x%x\n", Response->StructureSize);
+  Smb2Log(DIAG_VERBOSE, "SessionSetupResp.SecurityBufferLength = 0x%x\n",
+          Response->SecurityBufferLength);
+  Smb2Log(DIAG_VERBOSE, "NTLMChallengeMessage->Signature = %s\n",
+          reinterpret_cast<const CHAR8 *>(Challenge->Message));
+  Smb2Log(DIAG_VERBOSE, "NTLMChallengeMessage->MessageType = 0x%x\n",
+          SMB2ReadLe32(Challenge->Message + offsetof(SMB2_NTLMSSP_CHALLENGE_MESSAGE, MessageType)));
+}
+
+// The CHALLENGE copy and the AUTHENTICATE blob are scrubbed before they go.
+void ReleaseSession(SMB2_SESSION_CONTEXT *Session) {
+  if (Session->Challenge.Message != nullptr) {
+    ZeroMem(const_cast<UINT8 *>(Session->Challenge.Message), Session->Challenge.Length);
+    FreePool(const_cast<UINT8 *>(Session->Challenge.Message));
+  }
+  if (Session->Authenticate != nullptr) {
+    ZeroMem(Session->Authenticate, Session->AuthenticateLength);
+    FreePool(Session->Authenticate);
+  }
+  ZeroMem(Session, sizeof(*Session));
+  // ChallAttributes pointed into the challenge.
+  TransactDetails.ChallAttributes = nullptr;
+}
+
+// A tree disconnect or logoff: one exchange whose two halves are reported,
+// and the state it reaches.
+UINT32 RunTeardown(const SMB2_COMMAND *Command, UINT8 Reached) {
+  SMB2_SIMPLE_REQUEST Request;
+  SMB2_EXCHANGE_RESULT Result = SMB2Exchange(Command, &Request);
+  if (EFI_ERROR(SMB2MapNtStatus(Result.RequestCode, Command->RequestName))) {
+    return Result.RequestCode;
+  }
+  if (!EFI_ERROR(SMB2MapNtStatus(Result.ResponseCode, Command->ResponseName))) {
+    SMB2ConnectionState = Reached;
+  }
+  return Result.ResponseCode;
+}
+
 } // namespace
+
+EFI_STATUS SMB2Negotiate(const CHAR8 *IpAddress, SMB2_NEGOTIATE_REQUEST *Request, INT32 *SockFd,
+                         TRANSACT_DETAILS *Details) {
+  DiagEntry(DiagChannel::Smb2);
+  if (IpAddress == nullptr || Request == nullptr || Details == nullptr || SockFd == nullptr) {
+    Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Invalid Parameter!\n", __func__, __LINE__);
+    return EFI_INVALID_PARAMETER;
+  }
+  EFI_STATUS Status = SMB2NegotiateConnect(IpAddress, SockFd, Details);
+  if (EFI_ERROR(Status)) {
+    DiagError("SMB2NegotiateConnect failed!", Status);
+    return Status;
+  }
+  Smb2Log(DIAG_VERBOSE, "SockFd = %d\n", *SockFd);
+  SMB2_NEGOTIATE_CONTEXT Negotiate = {Request, EFI_SUCCESS};
+  SMB2_EXCHANGE_RESULT Result = SMB2Exchange(&gSMB2NegotiateCommand, &Negotiate);
+  if (Result.RequestCode != SMB2_NT_SUCCESS) {
+    return Result.RequestCode == SMB2_NT_INVALID_PARAMETER ? EFI_INVALID_PARAMETER
+                                                           : EFI_DEVICE_ERROR;
+  }
+  if (EFI_ERROR(Negotiate.Verdict)) {
+    Status = Negotiate.Verdict;
+    DiagError("SMB2VerifyExtractNegotiateResponse failed!", Status);
+  } else if (Result.ResponseCode != SMB2_NT_SUCCESS) {
+    Smb2Log(DIAG_ALWAYS,
+            "Function: %s, Line no.: = %d, SMB2NegotiateResponse failed! 0x%x (%d), TCP status = "
+            "%d\n",
+            __func__, __LINE__, Result.ResponseCode, Result.ResponseCode, Details->TransportStatus);
+    Status = EFI_PROTOCOL_ERROR;
+  } else {
+    PrintNegotiated(Details);
+  }
+  DiagExit(Status, DiagChannel::Smb2);
+  return Status;
+}
+
+EFI_STATUS SMB2SessionSetUp(INT32 SockFd, SMB2_SESSION_SETUP_RESPONSE *Response,
+                            TRANSACT_DETAILS *Details) {
+  DiagEntry(DiagChannel::Smb2);
+  (void)SockFd; // the exchange path uses the connection's socket
+  if (Response == nullptr || Details == nullptr) {
+    Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Invalid Parameter!\n", __func__, __LINE__);
+    return EFI_INVALID_PARAMETER;
+  }
+  SMB2_SESSION_CONTEXT Session;
+  ZeroMem(&Session, sizeof(Session));
+  Session.First = Response;
+  EFI_STATUS Status = SMB2MapExchange(SMB2Exchange(&gSMB2SessionNegotiateCommand, &Session),
+                                      &gSMB2SessionNegotiateCommand);
+  if (!EFI_ERROR(Status)) {
+    PrintChallenge(Response, &Session.Challenge);
+    Status = SMB2MapExchange(SMB2Exchange(&gSMB2SessionAuthenticateCommand, &Session),
+                             &gSMB2SessionAuthenticateCommand);
+  }
+  ReleaseSession(&Session);
+  if (!EFI_ERROR(Status)) {
+    SMB2ConnectionState = SMB2_STATE_SESSION;
+  }
+  DiagExit(Status, DiagChannel::Smb2);
+  return Status;
+}
+
+UINT32 SMB2TreeConnect(const CHAR8 *SharePath, TRANSACT_DETAILS *Details, INT32 SockFd) {
+  DiagEntry(DiagChannel::Smb2);
+  (void)Details;
+  (void)SockFd;
+  SMB2_TREE_CONTEXT Tree = {SharePath, nullptr};
+  UINT32 Nt = SMB2_NT_INVALID_PARAMETER;
+  EFI_STATUS Status = EFI_INVALID_PARAMETER;
+  if (SharePath == nullptr) {
+    DiagNullInput();
+    SMB2MapNtStatus(Nt, gSMB2TreeConnectCommand.RequestName);
+  } else {
+    SMB2_EXCHANGE_RESULT Result = SMB2Exchange(&gSMB2TreeConnectCommand, &Tree);
+    Nt = SMB2ExchangeCode(Result);
+    Status = SMB2MapExchange(Result, &gSMB2TreeConnectCommand);
+  }
+  FreePool(Tree.Packet);
+  if (!EFI_ERROR(Status)) {
+    SMB2ConnectionState = SMB2_STATE_TREE;
+  }
+  DiagExit(Status, DiagChannel::Smb2);
+  return Nt;
+}
+
+UINT32 SMB2TreeDisconnect(TRANSACT_DETAILS *Details, INT32 SockFd) {
+  (void)Details;
+  (void)SockFd;
+  return RunTeardown(&gSMB2TreeDisconnectCommand, SMB2_STATE_TREE_DISCONNECTED);
+}
+
+UINT32 SMB2LogOff(TRANSACT_DETAILS *Details, INT32 SockFd) {
+  (void)Details;
+  (void)SockFd;
+  return RunTeardown(&gSMB2LogOffCommand, SMB2_STATE_LOGGED_OFF);
+}
 
 EFI_STATUS FillShareDetails(const SMB2ConnectInfo *ConnectInfo, const SMB2ShareDetails *Share,
                             TRANSACT_DETAILS *Details) {
@@ -112,14 +268,12 @@ EFI_STATUS SMB2_Connect(SMB2ConnectInfo *ConnectInfo, SMB2ShareDetails *Share) {
       DiagError("SMB2Negotiate failed!", Status);
     } else {
       ConnectInfo->Connected = 1;
-      TransactDetails.MessageId++;
       PrintMessageId(__func__);
       SMB2_SESSION_SETUP_RESPONSE SetupResponse;
       Status = SMB2SessionSetUp(SockFd, &SetupResponse, &TransactDetails);
       if (EFI_ERROR(Status)) {
         DiagError("SMB2SessionSetup failed!", Status);
       } else {
-        TransactDetails.MessageId++;
         PrintMessageId(__func__);
         Status = SMB2MapNtStatus(SMB2TreeConnect(Share->Sharename, &TransactDetails, SockFd),
                                  "SMB2TreeConnect");

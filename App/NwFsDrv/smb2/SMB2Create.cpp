@@ -1,7 +1,5 @@
-// SMB2 CREATE and CLOSE, and the pieces every file operation shares: the
-// operation prologue and epilogue, the assembly of a request for the shared
-// send loop, the start of a response (header and fixed body) and the drain
-// of what a response announces beyond what the client reads.
+// SMB2 CREATE: the encoder (the fixed part, the UTF-16 name and the create
+// contexts) and the decoder (the file id).
 //
 // Ownership: the UTF-16 name buffer of a CREATE lives for one request. The
 // lease and durable contexts stay referenced by FileAccessDetails after the
@@ -12,10 +10,6 @@
 
 #include "DiagLog.h"
 #include "NwBaseLib.h"
-#include "smb2/SMB2Ntlmssp.h"
-
-SMB2_REQUEST_TRACE gSMB2RequestTrace[SMB2_REQUEST_TRACE_SLOTS];
-UINT64 gSMB2RequestCount;
 
 namespace {
 
@@ -96,100 +90,6 @@ void LogCreateResponse(const SMB2_CREATE_RESPONSE_BODY &Body) {
 // ---------------------------------------------------------------------------
 // Shared pieces
 // ---------------------------------------------------------------------------
-void SMB2TraceRequest(const SMB2_HEADER *Header, UINT32 Length, UINT64 Offset) {
-  SMB2_REQUEST_TRACE &Slot = gSMB2RequestTrace[gSMB2RequestCount % SMB2_REQUEST_TRACE_SLOTS];
-  Slot.Command = Header->Command;
-  Slot.CreditCharge = Header->CreditCharge;
-  Slot.Length = Length;
-  Slot.Offset = Offset;
-  gSMB2RequestCount++;
-}
-
-EFI_STATUS SMB2FileOpBegin(const CHAR8 *Function, UINT32 Line) {
-  if (gSMB2SockFd == 0) {
-    Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, gSMB2SockFd is 0!\n", Function, Line);
-    return EFI_NOT_FOUND;
-  }
-  TransactDetails.MessageId++;
-  return EFI_SUCCESS;
-}
-
-EFI_STATUS SMB2FileOpEnd(FILE_ACCESS_DETAILS *Access, UINT32 RequestCode, const CHAR8 *RequestName,
-                         UINT32 ResponseCode, const CHAR8 *ResponseName, const CHAR8 *Function,
-                         UINT32 Line) {
-  Access->TransportStatus = TransactDetails.TransportStatus;
-  if (RequestCode != SMB2_NT_SUCCESS) {
-    return SMB2MapNtStatus(RequestCode, RequestName, Function, Line);
-  }
-  return SMB2MapNtStatus(ResponseCode, ResponseName, Function, Line);
-}
-
-UINT32 SMB2SendFileRequest(INT32 SockFd, const SMB2_SEND_PIECE *Pieces, UINT32 Count, UINT64 Total,
-                           const CHAR8 *What, const CHAR8 *Function, UINT32 Line) {
-  const void *Message = Pieces[0].Bytes;
-  UINT8 *Assembled = nullptr;
-  if (Count > 1 || Pieces[0].Length != Total || Message == nullptr) {
-    Assembled = static_cast<UINT8 *>(AllocateZeroPool(Total + 1));
-    if (Assembled == nullptr) {
-      Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Buffer memory allocation failed!\n",
-              Function, Line);
-      return STATUS_NO_MEMORY;
-    }
-    UINT64 At = 0;
-    for (UINT32 I = 0; I < Count; I++) {
-      UINT64 Length = Pieces[I].Length < Total - At ? Pieces[I].Length : Total - At;
-      if (Pieces[I].Bytes != nullptr) {
-        CopyMem(Assembled + At, Pieces[I].Bytes, Length);
-      }
-      At += Length;
-    }
-    Message = Assembled;
-  }
-  UINT32 Transport = 0;
-  // A request assembled here already sits in a buffer of its own; a single
-  // piece gets its one copy from the send loop.
-  UINT32 Code = Assembled != nullptr ? SMB2SendAll(SockFd, Assembled, Total, &Transport)
-                                     : SMB2SendRequest(SockFd, Message, Total, &Transport);
-  TransactDetails.TransportStatus = Transport;
-  if (Code != SMB2_NT_SUCCESS) {
-    Smb2Log(DIAG_ALWAYS,
-            "Function: %s, Line no.: = %d, %s request send failed! Status = 0x%x (%d)\n", Function,
-            Line, What, Code, static_cast<INT32>(Code));
-  }
-  FreePool(Assembled);
-  return Code;
-}
-
-UINT32 SMB2ReadResponseStart(INT32 SockFd, SMB2_HEADER *Header, void *Body, UINT32 BodySize,
-                             bool ReadFixedBody, const CHAR8 *Function, UINT32 Line) {
-  UINT32 Nt = STATUS_UNSUCCESSFUL;
-  EFI_STATUS Status = SMB2ReadVerifyHeader(Header, &TransactDetails, SockFd, &Nt);
-  if (EFI_ERROR(Status)) {
-    DiagError("SMB2ReadVerifyHeader failed!", Status, Function, Line);
-    return Nt != SMB2_NT_SUCCESS ? Nt : STATUS_UNSUCCESSFUL;
-  }
-  UINT32 BodyLength = SMB2BodyLength(Header);
-  if (BodyLength < BodySize) {
-    Smb2Log(DIAG_ALWAYS,
-            "Function: %s, Line no.: = %d, Response body of %u bytes is shorter than its fixed "
-            "part of %u bytes!\n",
-            Function, Line, BodyLength, BodySize);
-    SMB2DrainBytes(SockFd, BodyLength, &TransactDetails);
-    return STATUS_UNSUCCESSFUL;
-  }
-  if (!ReadFixedBody) {
-    return SMB2_NT_SUCCESS;
-  }
-  INT32 Rx = SMB2ReceiveAll(SockFd, Body, BodySize, &TransactDetails);
-  if (Rx != 0) {
-    Smb2Log(DIAG_ALWAYS,
-            "Function: %s, Line no.: = %d, TCP_PollAndTryToRxAllData failed! Status = %ld\n",
-            Function, Line, static_cast<INT64>(Rx));
-    return static_cast<UINT32>(Rx);
-  }
-  return SMB2_NT_SUCCESS;
-}
-
 bool SMB2IsZeroFileId(const UINT8 *FileId) {
   for (UINTN I = 0; I < SMB2_FILE_ID_SIZE; I++) {
     if (FileId[I] != 0) {
@@ -199,19 +99,16 @@ bool SMB2IsZeroFileId(const UINT8 *FileId) {
   return true;
 }
 
-UINT32 SMB2ConstructFailureCode(EFI_STATUS Status) {
+UINT32 SMB2ConstructResult(EFI_STATUS Status, const CHAR8 *Failed, const CHAR8 *RequestName,
+                           UINT32 Line) {
+  if (!EFI_ERROR(Status)) {
+    return SMB2_NT_SUCCESS;
+  }
+  DiagError(Failed, Status, RequestName, Line);
   if (Status == EFI_INVALID_PARAMETER) {
     return SMB2_NT_INVALID_PARAMETER;
   }
   return Status == EFI_OUT_OF_RESOURCES ? STATUS_NO_MEMORY : STATUS_UNSUCCESSFUL;
-}
-
-UINT32 SMB2DrainMessageRest(INT32 SockFd, const SMB2_HEADER *Header, UINT64 Consumed) {
-  UINT64 BodyLength = SMB2BodyLength(Header);
-  if (BodyLength <= Consumed) {
-    return SMB2_NT_SUCCESS;
-  }
-  return SMB2DrainBytes(SockFd, BodyLength - Consumed, &TransactDetails);
 }
 
 // ---------------------------------------------------------------------------
@@ -340,8 +237,7 @@ EFI_STATUS SMB2CreateContextRequestPacketConstruct(SMB2_CREATE_REQUEST *Packet,
 
   UINT32 Total = sizeof(SMB2_CREATE_REQUEST) + Padded + ContextsLength + SMB2_CREATE_TRAILER;
   SMB2HeaderConstruct(&Packet->Header);
-  SMB2HeaderFill(&Packet->Header, SMB2_CREATE, Total, Details);
-  Packet->StructureSize = SMB2_CREATE_STRUCTURE_SIZE;
+  Packet->StructureSize = SMB2_REQUEST_STRUCTURE_SIZE[SMB2_CREATE];
   Packet->SecurityFlags = Access->SecurityFlags;
   Packet->RequestedOplockLevel = Access->RequestedOplockLevel;
   Packet->ImpersonationLevel = Access->ImpersonationLevel;
@@ -356,45 +252,6 @@ EFI_STATUS SMB2CreateContextRequestPacketConstruct(SMB2_CREATE_REQUEST *Packet,
   Packet->CreateContextsLength = ContextsLength;
   *TotalBytes = Total;
   return EFI_SUCCESS;
-}
-
-UINT32 SMB2CreateRequest(SMB2_CREATE_REQUEST *Packet, TRANSACT_DETAILS *Details,
-                         FILE_ACCESS_DETAILS *Access, INT32 SockFd) {
-  if (Packet == nullptr || Details == nullptr || Access == nullptr) {
-    LogNull(__func__, __LINE__);
-    return SMB2_NT_INVALID_PARAMETER;
-  }
-  UINT8 *Name = nullptr;
-  UINT32 NameSize = 0;
-  UINT32 Total = 0;
-  EFI_STATUS Status =
-      SMB2CreateContextRequestPacketConstruct(Packet, Details, Access, &Name, &NameSize, &Total);
-  if (EFI_ERROR(Status) || Total < sizeof(SMB2_CREATE_REQUEST)) {
-    DiagError("SMB2CreatePacketConstruct failed!", Status);
-    return SMB2ConstructFailureCode(Status);
-  }
-  // The contexts persist in the record, so a create that built none may
-  // still find earlier ones there: what is copied is bounded by this
-  // message's own CreateContextsLength. A durable context without a lease
-  // context is counted but not copied; its bytes go out as zeros.
-  UINT32 Room = Packet->CreateContextsLength;
-  UINT32 LeaseBytes = 0;
-  UINT32 DurableBytes = 0;
-  if (Access->LeaseContextLength != 0) {
-    LeaseBytes = Access->LeaseContextLength < Room ? Access->LeaseContextLength : Room;
-    Room -= LeaseBytes;
-    DurableBytes = Access->DurableContextLength < Room ? Access->DurableContextLength : Room;
-  }
-  const SMB2_SEND_PIECE Pieces[] = {
-      {Packet, sizeof(*Packet)},
-      {Name, NameSize},
-      {Access->LeaseContext, LeaseBytes},
-      {Access->DurableContext, DurableBytes},
-  };
-  SMB2TraceRequest(&Packet->Header, Total, 0);
-  UINT32 Code = SMB2SendFileRequest(SockFd, Pieces, 4, Total, "Create");
-  FreePool(Name);
-  return Code;
 }
 
 EFI_STATUS SMB2VerifyCreateResponse(const SMB2_CREATE_RESPONSE *Packet,
@@ -417,126 +274,80 @@ EFI_STATUS SMB2VerifyCreateResponse(const SMB2_CREATE_RESPONSE *Packet,
   return EFI_SUCCESS;
 }
 
-UINT32 SMB2CreateResponse(SMB2_CREATE_RESPONSE *Packet, TRANSACT_DETAILS *Details,
-                          FILE_ACCESS_DETAILS *Access, INT32 SockFd) {
-  if (Packet == nullptr || Details == nullptr || Access == nullptr) {
-    LogNull(__func__, __LINE__);
-    return SMB2_NT_INVALID_PARAMETER;
+namespace {
+
+UINT32 EncodeCreate(void *Context, TRANSACT_DETAILS *Details, SMB2_REQUEST *Request) {
+  SMB2_FILE_CONTEXT *File = static_cast<SMB2_FILE_CONTEXT *>(Context);
+  FILE_ACCESS_DETAILS *Access = File->Access;
+  SMB2_CREATE_REQUEST *Packet = &File->Packet.Create;
+  UINT32 NameSize = 0;
+  UINT32 Total = 0;
+  EFI_STATUS Status = SMB2CreateContextRequestPacketConstruct(Packet, Details, Access,
+                                                              &File->Allocated, &NameSize, &Total);
+  if (!EFI_ERROR(Status) && Total < sizeof(SMB2_CREATE_REQUEST)) {
+    Status = EFI_INVALID_PARAMETER;
   }
-  UINT32 Code = SMB2ReadResponseStart(SockFd, &Packet->Header, &Packet->Body, sizeof(Packet->Body));
+  UINT32 Code =
+      SMB2ConstructResult(Status, "SMB2CreatePacketConstruct failed!", "SMB2CreateRequest");
   if (Code != SMB2_NT_SUCCESS) {
     return Code;
   }
-  // The contexts are not interpreted: they, and any padding the message
-  // announces, are consumed. They must fit in what the message announces.
-  UINT64 Rest = SMB2BodyLength(&Packet->Header) - sizeof(Packet->Body);
-  UINT32 ContextsLength = Packet->Body.CreateContextsLength;
+  // The contexts persist in the record, so a create that built none may
+  // still find earlier ones there: what is copied is bounded by this
+  // message's own CreateContextsLength. A durable context without a lease
+  // context is counted but not copied; its bytes go out as zeros.
+  UINT32 Room = Packet->CreateContextsLength;
+  UINT32 LeaseBytes = 0;
+  UINT32 DurableBytes = 0;
+  if (Access->LeaseContextLength != 0) {
+    LeaseBytes = Access->LeaseContextLength < Room ? Access->LeaseContextLength : Room;
+    Room -= LeaseBytes;
+    DurableBytes = Access->DurableContextLength < Room ? Access->DurableContextLength : Room;
+  }
+  SMB2LayRequest(Request, Packet, sizeof(*Packet), Total);
+  SMB2AddPiece(Request, File->Allocated, NameSize);
+  SMB2AddPiece(Request, Access->LeaseContext, LeaseBytes);
+  SMB2AddPiece(Request, Access->DurableContext, DurableBytes);
+  return SMB2_NT_SUCCESS;
+}
+
+// The contexts of the answer are not interpreted; they must lie within what
+// the answer holds.
+UINT32 DecodeCreate(void *Context, const SMB2_RESPONSE *Answer) {
+  SMB2_FILE_CONTEXT *File = static_cast<SMB2_FILE_CONTEXT *>(Context);
+  SMB2_CREATE_RESPONSE Packet;
+  CopyMem(&Packet.Header, &Answer->Header, sizeof(Packet.Header));
+  CopyMem(&Packet.Body, Answer->Fixed, sizeof(Packet.Body));
+  UINT64 Rest = Answer->BodyLength - Answer->FixedLength;
+  UINT32 ContextsLength = Packet.Body.CreateContextsLength;
   if (ContextsLength == 0) {
     Smb2Log(DIAG_MISMATCH, "CreateResp->CreateContextsLength is 0!\n");
   } else if (ContextsLength > Rest) {
     Smb2Log(DIAG_ALWAYS,
             "Function: %s, Line no.: = %d, CreateContextsLength %u is beyond the %ld bytes the "
             "response holds!\n",
-            __func__, __LINE__, ContextsLength, static_cast<INT64>(Rest));
-    SMB2DrainMessageRest(SockFd, &Packet->Header, sizeof(Packet->Body));
+            "SMB2CreateResponse", __LINE__, ContextsLength, static_cast<INT64>(Rest));
     return STATUS_UNSUCCESSFUL;
   }
-  Code = SMB2DrainMessageRest(SockFd, &Packet->Header, sizeof(Packet->Body));
-  if (Code == STATUS_NO_MEMORY) {
-    return SMB2_NT_OUT_OF_MEMORY;
-  }
-  if (Code != SMB2_NT_SUCCESS) {
-    return Details->TransportStatus != 0 ? Details->TransportStatus : Code;
-  }
-  EFI_STATUS Status = SMB2VerifyCreateResponse(Packet, Details, Access);
+  EFI_STATUS Status = SMB2VerifyCreateResponse(&Packet, &TransactDetails, File->Access);
   if (Status == EFI_SECURITY_VIOLATION) {
     return STATUS_LOGON_FAILURE;
   }
   return EFI_ERROR(Status) ? STATUS_UNSUCCESSFUL : SMB2_NT_SUCCESS;
 }
 
-EFI_STATUS SMB2_Open(SMB2ShareDetails *Share, SMB2_CLIENT_SESSION *Session,
-                     FILE_ACCESS_DETAILS *Access) {
-  DiagEntry(DiagChannel::Smb2);
-  if (Share == nullptr || Session == nullptr || Access == nullptr) {
-    LogNull(__func__, __LINE__);
-    return EFI_INVALID_PARAMETER;
-  }
-  SMB2_CREATE_REQUEST Request;
-  SMB2_CREATE_RESPONSE Response;
-  EFI_STATUS Status = SMB2RunFileOperation(
-      Access, [&] { return SMB2CreateRequest(&Request, &TransactDetails, Access, gSMB2SockFd); },
-      "SMB2CreateRequest",
-      [&] { return SMB2CreateResponse(&Response, &TransactDetails, Access, gSMB2SockFd); },
-      "SMB2CreateResponse");
-  if (!EFI_ERROR(Status)) {
-    SMB2ConnectionState = SMB2_STATE_FILE_OPEN;
-  }
-  DiagExit(Status, DiagChannel::Smb2);
-  return Status;
-}
+} // namespace
 
-// ---------------------------------------------------------------------------
-// CLOSE
-// ---------------------------------------------------------------------------
-EFI_STATUS SMB2ClosePacketConstruct(SMB2_CLOSE_REQUEST *Packet, const TRANSACT_DETAILS *Details,
-                                    const FILE_ACCESS_DETAILS *Access) {
-  if (Packet == nullptr || Details == nullptr || Access == nullptr) {
-    LogNull(__func__, __LINE__);
-    return EFI_INVALID_PARAMETER;
-  }
-  ZeroMem(Packet, sizeof(*Packet));
-  SMB2HeaderConstruct(&Packet->Header);
-  SMB2HeaderFill(&Packet->Header, SMB2_CLOSE, sizeof(*Packet), Details);
-  Packet->StructureSize = SMB2_CLOSE_STRUCTURE_SIZE;
-  Packet->Flags = Access->SecurityFlags;
-  CopyMem(Packet->FileId, Access->FileId, SMB2_FILE_ID_SIZE);
-  return EFI_SUCCESS;
-}
-
-UINT32 SMB2CloseRequest(SMB2_CLOSE_REQUEST *Packet, TRANSACT_DETAILS *Details,
-                        FILE_ACCESS_DETAILS *Access, INT32 SockFd) {
-  EFI_STATUS Status = SMB2ClosePacketConstruct(Packet, Details, Access);
-  if (EFI_ERROR(Status)) {
-    return SMB2_NT_INVALID_PARAMETER;
-  }
-  const SMB2_SEND_PIECE Piece = {Packet, sizeof(*Packet)};
-  SMB2TraceRequest(&Packet->Header, sizeof(*Packet), 0);
-  return SMB2SendFileRequest(SockFd, &Piece, 1, sizeof(*Packet), "Close");
-}
-
-UINT32 SMB2CloseResponse(SMB2_CLOSE_REQUEST *Packet, TRANSACT_DETAILS *Details,
-                         FILE_ACCESS_DETAILS *Access, INT32 SockFd) {
-  if (Packet == nullptr || Details == nullptr || Access == nullptr) {
-    LogNull(__func__, __LINE__);
-    return SMB2_NT_INVALID_PARAMETER;
-  }
-  // The 60-byte body is read and its content ignored.
-  constexpr UINT32 kCloseResponseBody = 60;
-  UINT8 Body[kCloseResponseBody];
-  SMB2_HEADER Header;
-  UINT32 Code = SMB2ReadResponseStart(SockFd, &Header, Body, sizeof(Body));
-  if (Code != SMB2_NT_SUCCESS) {
-    return Code;
-  }
-  return SMB2DrainMessageRest(SockFd, &Header, sizeof(Body));
-}
-
-EFI_STATUS SMB2_Close(FILE_ACCESS_DETAILS *Access) {
-  DiagEntry(DiagChannel::Smb2);
-  if (Access == nullptr) {
-    LogNull(__func__, __LINE__);
-    return EFI_INVALID_PARAMETER;
-  }
-  SMB2_CLOSE_REQUEST Request;
-  EFI_STATUS Status = SMB2RunFileOperation(
-      Access, [&] { return SMB2CloseRequest(&Request, &TransactDetails, Access, gSMB2SockFd); },
-      "SMB2CloseRequest",
-      [&] { return SMB2CloseResponse(&Request, &TransactDetails, Access, gSMB2SockFd); },
-      "SMB2CloseResponse");
-  if (!EFI_ERROR(Status)) {
-    SMB2ConnectionState = SMB2_STATE_FILE_CLOSED;
-  }
-  DiagExit(Status, DiagChannel::Smb2);
-  return Status;
-}
+const SMB2_COMMAND gSMB2CreateCommand = {
+    SMB2_CREATE,
+    0,
+    sizeof(SMB2_CREATE_RESPONSE_BODY),
+    0,
+    "SMB2CreateRequest",
+    "SMB2CreateResponse",
+    "Create request send failed!",
+    &gSMB2FileReceiveTexts,
+    EncodeCreate,
+    nullptr,
+    DecodeCreate,
+};

@@ -3,34 +3,25 @@
 // fill (FileAccessDetails, QueryDetails) and the directory nodes a listing is
 // turned into.
 //
-// Every operation follows one pattern: the operation (SMB2_Open, SMB2_Read,
-// ...) checks its arguments and the socket, advances the message id, runs
-// the request function and, when that succeeded, the response function, and
-// maps their NT-style codes to EFI_STATUS. Request functions build the
-// message and hand it to the shared send loop; response functions read the
-// header with SMB2ReadVerifyHeader, then the fixed body, then the variable
-// part, and always consume the whole announced message so that the next
-// exchange starts on a message boundary.
+// Each command file holds the encoder and the decoder of its command; the
+// operations (SMB2FileOps.cpp) run them through the exchange path
+// (SMB2Exchange.h), which frames, sends, receives, checks and drains.
 //
-// Every length and offset a server sends is checked against the bytes the
-// message announces, against what the client asked for and against the
-// buffer it lands in before it is used; a violation consumes the message and
-// fails the operation with a message naming the field.
+// Every length and offset a server sends is checked against the bytes that
+// arrived, against what the client asked for and against the buffer it lands
+// in before it is used; a violation fails the operation with a message naming
+// the field.
 #pragma once
 
+#include "NwBackend.h"
 #include "smb2/SMB2Connect.h"
-#include "smb2/SMB2Header.h"
+#include "smb2/SMB2Exchange.h"
 
 // ---------------------------------------------------------------------------
 // Records
 // ---------------------------------------------------------------------------
 constexpr UINTN SMB2_FILE_ID_SIZE = 16;
 constexpr UINTN SMB2_FILE_NAME_FIELD = 592;
-// CREATE accepts names shorter than this many characters.
-constexpr UINTN SMB2_FILE_NAME_LIMIT = 255;
-// The client session record passed beside the share details; its content is
-// never read, the operations only require it to be present.
-constexpr UINTN SMB2_CLIENT_SESSION_SIZE = 40;
 
 #pragma pack(push, 1)
 // Byte image of FileAllInformation up to its first four name bytes; the
@@ -126,24 +117,10 @@ struct QUERY_DETAILS {
   UINT8 *Buffer;
 };
 
-// One directory entry of a listing, in the adapter's singly linked list.
-struct SMB2_DIR_NODE {
-  SMB2_DIR_NODE *Next;
-  UINT32 FileIndex;
-  UINT64 CreationTime;
-  UINT64 LastAccessTime;
-  UINT64 LastWriteTime;
-  UINT64 ChangeTime;
-  UINT64 EndOfFile;
-  UINT64 AllocationSize;
-  UINT32 FileAttributes;
-  UINT32 FileNameLength; // bytes
-  UINT32 EaSize;
-  UINT8 FileName[512]; // UTF-16, zero-filled beyond the name
-};
-
+// The client session record passed beside the share details; its content is
+// never read, the operations only require it to be present.
 struct SMB2_CLIENT_SESSION {
-  UINT8 Reserved[SMB2_CLIENT_SESSION_SIZE];
+  UINT8 Reserved[40];
 };
 #pragma pack(pop)
 
@@ -178,11 +155,6 @@ static_assert(sizeof(FILE_ACCESS_DETAILS) == 899, "FileAccessDetails size");
 static_assert(sizeof(QUERY_DETAILS) == 26, "QueryDetails size");
 static_assert(offsetof(QUERY_DETAILS, InputBufferLength) == 2, "InputBufferLength offset");
 static_assert(offsetof(QUERY_DETAILS, Buffer) == 18, "QueryDetails buffer offset");
-static_assert(offsetof(SMB2_DIR_NODE, FileIndex) == 8, "node FileIndex offset");
-static_assert(offsetof(SMB2_DIR_NODE, EndOfFile) == 44, "node EndOfFile offset");
-static_assert(offsetof(SMB2_DIR_NODE, FileAttributes) == 60, "node FileAttributes offset");
-static_assert(offsetof(SMB2_DIR_NODE, FileName) == 72, "node FileName offset");
-static_assert(sizeof(SMB2_DIR_NODE) == 584, "directory node size");
 
 // Every node is allocated at this fixed size, whatever its name needs.
 constexpr UINTN SMB2_DIR_NODE_ALLOCATION = 1204;
@@ -345,20 +317,10 @@ struct SMB2_QUERY_RESPONSE_BODY {
   UINT32 OutputBufferLength;
 };
 
-// The framed header with a response's fixed body, as a response function
-// keeps it. The READ body area is twice the fixed body, because a first
-// receive that stops inside the body has its rest placed at twice the count
-// received.
+// The framed header with a response's fixed body, as a decoder checks it.
 struct SMB2_CREATE_RESPONSE {
   SMB2_HEADER Header;
   SMB2_CREATE_RESPONSE_BODY Body;
-};
-struct SMB2_READ_RESPONSE {
-  SMB2_HEADER Header;
-  union {
-    SMB2_READ_RESPONSE_BODY Body;
-    UINT8 Raw[2 * sizeof(SMB2_READ_RESPONSE_BODY)];
-  };
 };
 struct SMB2_QUERY_RESPONSE {
   SMB2_HEADER Header;
@@ -449,26 +411,37 @@ static_assert(offsetof(SMB2_QUERY_DIRECTORY_REQUEST, OutputBufferLength) == 96, 
 static_assert(sizeof(SMB2_QUERY_RESPONSE_BODY) == 8, "query response fixed body");
 static_assert(offsetof(SMB2_QUERY_RESPONSE_BODY, OutputBufferLength) == 4, "output length");
 static_assert(sizeof(SMB2_CREATE_RESPONSE) == 156, "CREATE response header and body");
-static_assert(sizeof(SMB2_READ_RESPONSE) == 100, "READ response header and body area");
 static_assert(sizeof(SMB2_QUERY_RESPONSE) == 76, "query response header and body");
 
 // FileFullDirectoryInformation entry: the fixed part before the name.
-constexpr UINT32 SMB2_FULL_DIR_NEXT_OFFSET = 0;
-constexpr UINT32 SMB2_FULL_DIR_FILE_INDEX = 4;
-constexpr UINT32 SMB2_FULL_DIR_CREATION_TIME = 8;
-constexpr UINT32 SMB2_FULL_DIR_LAST_ACCESS_TIME = 16;
-constexpr UINT32 SMB2_FULL_DIR_LAST_WRITE_TIME = 24;
-constexpr UINT32 SMB2_FULL_DIR_CHANGE_TIME = 32;
-constexpr UINT32 SMB2_FULL_DIR_END_OF_FILE = 40;
-constexpr UINT32 SMB2_FULL_DIR_ALLOCATION_SIZE = 48;
-constexpr UINT32 SMB2_FULL_DIR_ATTRIBUTES = 56;
-constexpr UINT32 SMB2_FULL_DIR_NAME_LENGTH = 60;
-constexpr UINT32 SMB2_FULL_DIR_EA_SIZE = 64;
-constexpr UINT32 SMB2_FULL_DIR_NAME = 68;
+#pragma pack(push, 1)
+struct SMB2_FULL_DIR_ENTRY {
+  UINT32 NextEntryOffset;
+  UINT32 FileIndex;
+  UINT64 CreationTime;
+  UINT64 LastAccessTime;
+  UINT64 LastWriteTime;
+  UINT64 ChangeTime;
+  UINT64 EndOfFile;
+  UINT64 AllocationSize;
+  UINT32 FileAttributes;
+  UINT32 FileNameLength; // bytes
+  UINT32 EaSize;
+};
+#pragma pack(pop)
+static_assert(offsetof(SMB2_FULL_DIR_ENTRY, FileIndex) == 4, "entry FileIndex offset");
+static_assert(offsetof(SMB2_FULL_DIR_ENTRY, EndOfFile) == 40, "entry EndOfFile offset");
+static_assert(offsetof(SMB2_FULL_DIR_ENTRY, FileAttributes) == 56, "entry attributes offset");
+static_assert(offsetof(SMB2_FULL_DIR_ENTRY, FileNameLength) == 60, "entry name length offset");
+static_assert(sizeof(SMB2_FULL_DIR_ENTRY) == 68, "the name follows at 68");
+// Where an entry's name begins.
+constexpr UINT32 SMB2_FULL_DIR_NAME = sizeof(SMB2_FULL_DIR_ENTRY);
 
 // ---------------------------------------------------------------------------
 // Constants
 // ---------------------------------------------------------------------------
+// CREATE accepts names shorter than this many characters.
+constexpr UINTN SMB2_FILE_NAME_LIMIT = 255;
 constexpr UINT16 SMB2_CREATE_NAME_OFFSET = 120; // from the SMB2 header
 constexpr UINT32 SMB2_CREATE_NAME_ALIGN = 8;
 constexpr UINT32 SMB2_CREATE_TRAILER = 2; // zero bytes after the contexts
@@ -503,86 +476,68 @@ constexpr UINT8 FILE_END_OF_FILE_INFORMATION = 20;
 constexpr UINT8 FILE_FS_SIZE_INFORMATION = 3;
 
 // ---------------------------------------------------------------------------
-// The request trace: every file-operation request as it was built, for tests
-// and diagnostics (a ring of the most recent ones and a running count).
-// ---------------------------------------------------------------------------
-struct SMB2_REQUEST_TRACE {
-  UINT16 Command;
-  UINT16 CreditCharge;
-  UINT32 Length; // READ/WRITE data length, else the message length
-  UINT64 Offset; // READ/WRITE file offset, else 0
-};
-constexpr UINT32 SMB2_REQUEST_TRACE_SLOTS = 64;
-extern SMB2_REQUEST_TRACE gSMB2RequestTrace[SMB2_REQUEST_TRACE_SLOTS];
-extern UINT64 gSMB2RequestCount;
-void SMB2TraceRequest(const SMB2_HEADER *Header, UINT32 Length, UINT64 Offset);
-
-// ---------------------------------------------------------------------------
-// Pieces shared by the file operations
-// ---------------------------------------------------------------------------
-// The two halves of the operation pattern below: the socket must be open
-// (else "gSMB2SockFd is 0!" and EFI_NOT_FOUND) and the message id advances
-// by one; afterwards the record receives the transport status and the
-// request's code, or when that was 0 the response's, is mapped naming the
-// function that returned it.
-EFI_STATUS SMB2FileOpBegin(const CHAR8 *Function, UINT32 Line);
-EFI_STATUS SMB2FileOpEnd(FILE_ACCESS_DETAILS *Access, UINT32 RequestCode, const CHAR8 *RequestName,
-                         UINT32 ResponseCode, const CHAR8 *ResponseName, const CHAR8 *Function,
-                         UINT32 Line);
-
-// The operation pattern every file operation follows: prologue, the request
-// function and, only when it succeeded, the response function, epilogue.
-template <typename RequestFn, typename ResponseFn>
-EFI_STATUS
-SMB2RunFileOperation(FILE_ACCESS_DETAILS *Access, RequestFn Request, const CHAR8 *RequestName,
-                     ResponseFn Response, const CHAR8 *ResponseName,
-                     const CHAR8 *Function = __builtin_FUNCTION(), UINT32 Line = __builtin_LINE()) {
-  EFI_STATUS Status = SMB2FileOpBegin(Function, Line);
-  if (EFI_ERROR(Status)) {
-    return Status;
-  }
-  UINT32 RequestCode = Request();
-  UINT32 ResponseCode = RequestCode == SMB2_NT_SUCCESS ? Response() : SMB2_NT_SUCCESS;
-  return SMB2FileOpEnd(Access, RequestCode, RequestName, ResponseCode, ResponseName, Function,
-                       Line);
-}
-
-// One piece of a request message; a null Bytes pointer stands for zeros.
-struct SMB2_SEND_PIECE {
-  const void *Bytes;
-  UINT64 Length;
-};
-// Lays the pieces out in one zero-filled buffer of Total bytes (pieces that
-// would run past Total are cut) and sends it with the shared send loop. A
-// failed send prints "<What> request send failed!". Returns the NT-style code.
-UINT32 SMB2SendFileRequest(INT32 SockFd, const SMB2_SEND_PIECE *Pieces, UINT32 Count, UINT64 Total,
-                           const CHAR8 *What, const CHAR8 *Function = __builtin_FUNCTION(),
-                           UINT32 Line = __builtin_LINE());
-
-// Reads and checks the response header into *Header (the header read skips
-// interim answers on the way to the final one), then, with
-// ReadFixedBody, the body's fixed part of BodySize bytes into Body. A message
-// too short for its fixed part is consumed and refused. Returns the NT-style
-// code (0, STATUS_UNSUCCESSFUL, or the transport status of a failed receive).
-UINT32 SMB2ReadResponseStart(INT32 SockFd, SMB2_HEADER *Header, void *Body, UINT32 BodySize,
-                             bool ReadFixedBody = true,
-                             const CHAR8 *Function = __builtin_FUNCTION(),
-                             UINT32 Line = __builtin_LINE());
-// Consumes what is left of a message after Consumed of its body bytes.
-UINT32 SMB2DrainMessageRest(INT32 SockFd, const SMB2_HEADER *Header, UINT64 Consumed);
-// True when all 16 bytes of a file id are zero (no file open).
-bool SMB2IsZeroFileId(const UINT8 *FileId);
-// The NT-style code a request function returns when its packet could not be
-// built: invalid parameter, no memory, or unsuccessful.
-UINT32 SMB2ConstructFailureCode(EFI_STATUS Status);
-
-// ---------------------------------------------------------------------------
-// CREATE and CLOSE
+// The file operations. Each runs one command through the exchange path: it
+// checks its arguments and the socket (else "gSMB2SockFd is 0!" and
+// EFI_NOT_FOUND), runs the exchange, copies the transport status into
+// FileAccessDetails and maps the command's code naming the half that failed.
 // ---------------------------------------------------------------------------
 EFI_STATUS SMB2_Open(SMB2ShareDetails *Share, SMB2_CLIENT_SESSION *Session,
                      FILE_ACCESS_DETAILS *Access);
 EFI_STATUS SMB2_Close(FILE_ACCESS_DETAILS *Access);
+// READ and WRITE move at most one request's worth per call. The channel info
+// travels in a query record's input buffer (length and bytes); callers pass
+// a record whose length is 0.
+EFI_STATUS SMB2_Read(SMB2ShareDetails *Share, SMB2_CLIENT_SESSION *Session,
+                     const QUERY_DETAILS *ChannelInfo, FILE_ACCESS_DETAILS *Access, void *Data);
+EFI_STATUS SMB2_Write(SMB2ShareDetails *Share, SMB2_CLIENT_SESSION *Session,
+                      const QUERY_DETAILS *ChannelInfo, FILE_ACCESS_DETAILS *Access,
+                      const void *Data);
+EFI_STATUS SMB2_FSInfo(SMB2ShareDetails *Share, SMB2_CLIENT_SESSION *Session,
+                       const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access);
+EFI_STATUS SMB2_DirInfo(SMB2ShareDetails *Share, SMB2_CLIENT_SESSION *Session,
+                        const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access);
 
+// ---------------------------------------------------------------------------
+// The commands: what their encoders and decoders work on, and the command
+// records the operations run.
+// ---------------------------------------------------------------------------
+struct SMB2_FILE_CONTEXT {
+  FILE_ACCESS_DETAILS *Access;
+  const QUERY_DETAILS *Query; // QUERY_INFO, QUERY_DIRECTORY; channel info of READ
+  void *Data;                 // READ destination, WRITE source
+  union {
+    SMB2_CREATE_REQUEST Create;
+    SMB2_CLOSE_REQUEST Close;
+    SMB2_READ_REQUEST Read;
+    SMB2_WRITE_REQUEST Write;
+    SMB2_QUERY_INFO_REQUEST QueryInfo;
+    SMB2_QUERY_DIRECTORY_REQUEST QueryDirectory;
+  } Packet;
+  UINT8 *Allocated; // a buffer the encoder made for this request (name, channel info)
+  const struct SMB2_QUERY_ANSWER_TEXTS *Answer; // QUERY_INFO, QUERY_DIRECTORY
+};
+extern const SMB2_COMMAND gSMB2CreateCommand;
+extern const SMB2_COMMAND gSMB2CloseCommand;
+extern const SMB2_COMMAND gSMB2ReadCommand;
+extern const SMB2_COMMAND gSMB2WriteCommand;
+extern const SMB2_COMMAND gSMB2QueryInfoCommand;
+extern const SMB2_COMMAND gSMB2QueryDirectoryCommand;
+
+// Dialects 2.0.2 and 2.1 know no channels: READ and WRITE send none.
+inline bool SMB2DialectWithoutChannels(UINT16 Dialect) {
+  return Dialect == SMB2_DIALECT_202 || Dialect == SMB2_DIALECT_210;
+}
+// True when all 16 bytes of a file id are zero (no file open).
+bool SMB2IsZeroFileId(const UINT8 *FileId);
+// The code an encoder returns for its packet construct's Status: 0, or (with
+// "<Failed>" reported under the request half's name) invalid parameter, no
+// memory, or unsuccessful.
+UINT32 SMB2ConstructResult(EFI_STATUS Status, const CHAR8 *Failed, const CHAR8 *RequestName,
+                           UINT32 Line = __builtin_LINE());
+
+// ---------------------------------------------------------------------------
+// CREATE and CLOSE
+// ---------------------------------------------------------------------------
 // Fills the 124-byte fixed part, allocates the padded UTF-16 name (*Name,
 // *NameSize bytes, null for the root) and builds the create contexts.
 EFI_STATUS SMB2CreateContextRequestPacketConstruct(SMB2_CREATE_REQUEST *Packet,
@@ -591,62 +546,32 @@ EFI_STATUS SMB2CreateContextRequestPacketConstruct(SMB2_CREATE_REQUEST *Packet,
                                                    UINT32 *NameSize, UINT32 *TotalBytes);
 EFI_STATUS SMB2CreateLeaseBuf(const UINT8 *LeaseKey, UINT8 OplockLevel, UINT8 **Context);
 EFI_STATUS SMB2CreateDurableBuf(const UINT8 *LeaseKey, UINT8 OplockLevel, UINT8 **Context);
-UINT32 SMB2CreateRequest(SMB2_CREATE_REQUEST *Packet, TRANSACT_DETAILS *Details,
-                         FILE_ACCESS_DETAILS *Access, INT32 SockFd);
-UINT32 SMB2CreateResponse(SMB2_CREATE_RESPONSE *Packet, TRANSACT_DETAILS *Details,
-                          FILE_ACCESS_DETAILS *Access, INT32 SockFd);
 EFI_STATUS SMB2VerifyCreateResponse(const SMB2_CREATE_RESPONSE *Packet,
                                     const TRANSACT_DETAILS *Details, FILE_ACCESS_DETAILS *Access);
-
 EFI_STATUS SMB2ClosePacketConstruct(SMB2_CLOSE_REQUEST *Packet, const TRANSACT_DETAILS *Details,
                                     const FILE_ACCESS_DETAILS *Access);
-UINT32 SMB2CloseRequest(SMB2_CLOSE_REQUEST *Packet, TRANSACT_DETAILS *Details,
-                        FILE_ACCESS_DETAILS *Access, INT32 SockFd);
-UINT32 SMB2CloseResponse(SMB2_CLOSE_REQUEST *Packet, TRANSACT_DETAILS *Details,
-                         FILE_ACCESS_DETAILS *Access, INT32 SockFd);
-
 // Frees the create contexts the record references and clears their
 // pointers and lengths.
 void SMB2FreeCreateContexts(FILE_ACCESS_DETAILS *Access);
 
 // ---------------------------------------------------------------------------
-// READ and WRITE (at most one request's worth per call)
+// READ and WRITE
 // ---------------------------------------------------------------------------
-// The channel info travels in a query record's input buffer (length and
-// bytes); callers pass a record whose length is 0.
-EFI_STATUS SMB2_Read(SMB2ShareDetails *Share, SMB2_CLIENT_SESSION *Session,
-                     const QUERY_DETAILS *ChannelInfo, FILE_ACCESS_DETAILS *Access, void *Data);
-EFI_STATUS SMB2_Write(SMB2ShareDetails *Share, SMB2_CLIENT_SESSION *Session,
-                      const QUERY_DETAILS *ChannelInfo, FILE_ACCESS_DETAILS *Access,
-                      const void *Data);
-
 EFI_STATUS SMB2ReadPacketConstruct(SMB2_READ_REQUEST *Packet, const TRANSACT_DETAILS *Details,
                                    FILE_ACCESS_DETAILS *Access, UINT8 **ChannelCopy,
                                    UINT32 *TotalBytes);
-UINT32 SMB2ReadRequest(SMB2_READ_REQUEST *Packet, TRANSACT_DETAILS *Details,
-                       FILE_ACCESS_DETAILS *Access, INT32 SockFd);
-// Receives the data straight into Data, never more than the request's
-// Length.
-UINT32 SMB2ReadResponse(SMB2_READ_RESPONSE *Packet, TRANSACT_DETAILS *Details,
-                        FILE_ACCESS_DETAILS *Access, INT32 SockFd, void *Data);
 EFI_STATUS SMB2WritePacketConstruct(SMB2_WRITE_REQUEST *Packet, const TRANSACT_DETAILS *Details,
                                     const FILE_ACCESS_DETAILS *Access, UINT32 *TotalBytes);
-UINT32 SMB2WriteRequest(SMB2_WRITE_REQUEST *Packet, TRANSACT_DETAILS *Details,
-                        FILE_ACCESS_DETAILS *Access, INT32 SockFd, const void *Data);
-UINT32 SMB2WriteResponse(TRANSACT_DETAILS *Details, FILE_ACCESS_DETAILS *Access, INT32 SockFd);
 
 // ---------------------------------------------------------------------------
-// QUERY_INFO
+// QUERY_INFO and QUERY_DIRECTORY
 // ---------------------------------------------------------------------------
-EFI_STATUS SMB2_FSInfo(SMB2ShareDetails *Share, SMB2_CLIENT_SESSION *Session,
-                       const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access);
 EFI_STATUS SMB2QueryInfoPacketConstruct(SMB2_QUERY_INFO_REQUEST *Packet,
                                         const TRANSACT_DETAILS *Details, const QUERY_DETAILS *Query,
                                         const FILE_ACCESS_DETAILS *Access, UINT32 *TotalBytes);
-UINT32 SMB2QueryInfoRequest(SMB2_QUERY_INFO_REQUEST *Packet, TRANSACT_DETAILS *Details,
-                            const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access, INT32 SockFd);
-UINT32 SMB2QueryInfoResponse(SMB2_QUERY_RESPONSE *Packet, TRANSACT_DETAILS *Details,
-                             const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access, INT32 SockFd);
+EFI_STATUS SMB2QueryDirPacketConstruct(SMB2_QUERY_DIRECTORY_REQUEST *Packet,
+                                       const TRANSACT_DETAILS *Details, const QUERY_DETAILS *Query,
+                                       const FILE_ACCESS_DETAILS *Access, UINT32 *TotalBytes);
 // Stores an answer of Packet->Body.OutputBufferLength bytes at Output into
 // the record's result fields. A fixed-size class whose answer is shorter
 // than the class's structure is refused (EFI_PROTOCOL_ERROR).
@@ -659,30 +584,18 @@ struct SMB2_QUERY_ANSWER_TEXTS {
   const CHAR8 *Empty;
   const CHAR8 *Failed;
   const CHAR8 *LogonFailed;
+  const CHAR8 *Function; // the answer half the lines name
 };
-// Reads a QUERY_INFO or QUERY_DIRECTORY answer: header, fixed body and the
-// output, which must fit both what the message holds and the limit; stores
-// it with SMB2VerifyInfoStructure and consumes the rest of the message.
-UINT32 SMB2ReadQueryResponse(INT32 SockFd, SMB2_QUERY_RESPONSE *Packet, const QUERY_DETAILS *Query,
-                             FILE_ACCESS_DETAILS *Access, const SMB2_QUERY_ANSWER_TEXTS &Texts,
-                             const CHAR8 *Function = __builtin_FUNCTION(),
-                             UINT32 Line = __builtin_LINE());
+extern const SMB2_QUERY_ANSWER_TEXTS gSMB2QueryInfoTexts;
+extern const SMB2_QUERY_ANSWER_TEXTS gSMB2QueryDirectoryTexts;
+// The decoder of both: a QUERY_INFO or QUERY_DIRECTORY answer (with the
+// context's texts); the output must fit what arrived and the limit, and is
+// stored with SMB2VerifyInfoStructure.
+UINT32 SMB2DecodeQueryAnswer(void *Context, const SMB2_RESPONSE *Answer);
 
 // ---------------------------------------------------------------------------
-// QUERY_DIRECTORY and directory nodes
+// Directory nodes
 // ---------------------------------------------------------------------------
-EFI_STATUS SMB2_DirInfo(SMB2ShareDetails *Share, SMB2_CLIENT_SESSION *Session,
-                        const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access);
-EFI_STATUS SMB2QueryDirPacketConstruct(SMB2_QUERY_DIRECTORY_REQUEST *Packet,
-                                       const TRANSACT_DETAILS *Details, const QUERY_DETAILS *Query,
-                                       const FILE_ACCESS_DETAILS *Access, UINT32 *TotalBytes);
-UINT32 SMB2QueryDirInfoRequest(SMB2_QUERY_DIRECTORY_REQUEST *Packet, TRANSACT_DETAILS *Details,
-                               const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access,
-                               INT32 SockFd);
-UINT32 SMB2QueryDirInfoResponse(SMB2_QUERY_RESPONSE *Packet, TRANSACT_DETAILS *Details,
-                                const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access,
-                                INT32 SockFd);
-
 EFI_STATUS SMB2_CreateDirNode(SMB2_DIR_NODE **Node, UINTN Size);
 // Appends Node at the end of the list at *Head.
 EFI_STATUS SMB2_AddDirNode(SMB2_DIR_NODE **Head, SMB2_DIR_NODE *Node);

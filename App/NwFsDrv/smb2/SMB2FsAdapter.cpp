@@ -5,6 +5,12 @@
 #include "NwBaseLib.h"
 #include "smb2/TcpTransport.h"
 
+const NW_BACKEND gSMB2FsBackend = {
+    NW_BACKEND_REVISION, SMB2_FSResetState, SMB2_FSConnect, SMB2_FSDisconnect,
+    SMB2_FOpen,          SMB2_FRead,        SMB2_FWrite,    SMB2_FClose,
+    SMB2_GetFSInfo,      SMB2_FindFirst,    SMB2_FindNext,  SMB2_GetFileStat,
+};
+
 SMB2ConnectInfo gSMB2ConnectInfo;
 SMB2ShareDetails gSMB2ShareDetails;
 SMB2_CLIENT_SESSION gSMB2ClientSession;
@@ -410,34 +416,16 @@ EFI_STATUS SMB2_FWrite(NW_SHARE_INFO *Volume, NW_REMOTE_FILE *File, const void *
   // The query record doubles as the write channel-info record: no channel.
   gQueryDetails.InputBufferLength = 0;
   PrepareTransfer(File, Offset, static_cast<UINT32>(Requested));
-  const UINT8 *Source = static_cast<const UINT8 *>(Buffer);
-  UINTN SourceOffset = 0;
   UINTN Total = 0;
   EFI_STATUS Status = EFI_SUCCESS;
   if (Requested > 0) {
     F.ReadWriteInfo.BytesWritten = 0;
-    while (Total < Requested) {
-      F.ReadWriteInfo.Length = ChunkLength(Requested - Total);
-      Status = SMB2_Write(&gSMB2ShareDetails, &gSMB2ClientSession, &gQueryDetails, &F,
-                          Source + SourceOffset);
-      if (EFI_ERROR(Status)) {
-        DiagError("SMB2_Write failed!", Status);
-        break;
-      }
-      UINT64 Written = F.ReadWriteInfo.BytesWritten;
-      if (Written == 0) {
-        break;
-      }
-      Total += Written;
-      F.ReadWriteInfo.FileOffset += Written;
-      // Deliberately kept: the source advances by the last READ's count,
-      // which the write path never sets. Callers hand over one request's
-      // worth at a time. The position never passes what has been written,
-      // so no chunk reads outside the caller's buffer.
-      SourceOffset += F.ReadWriteInfo.BytesRead;
-      if (SourceOffset > Total) {
-        SourceOffset = Total;
-      }
+    Status = SMB2_Write(&gSMB2ShareDetails, &gSMB2ClientSession, &gQueryDetails, &F, Buffer);
+    if (EFI_ERROR(Status)) {
+      DiagError("SMB2_Write failed!", Status);
+    } else {
+      Total = static_cast<UINTN>(F.ReadWriteInfo.BytesWritten);
+      F.ReadWriteInfo.FileOffset += Total;
       if (Total == Requested) {
         Smb2Log(DIAG_VERBOSE, "%s: All the bytes %ld are written\n", __func__,
                 static_cast<INT64>(Total));

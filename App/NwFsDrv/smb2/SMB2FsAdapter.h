@@ -1,7 +1,7 @@
 // The SMB2 file-system adapter: what the network volume sees of the SMB2
-// client. It connects and disconnects a share, opens, reads, writes and
-// closes one file at a time, lists a directory one entry at a time and
-// reports file and volume information in UEFI terms.
+// client, through the back-end table it fills (gSMB2FsBackend, NwBackend.h). It connects and
+// disconnects a share, opens, reads, writes and closes one file at a time, lists a directory one
+// entry at a time and reports file and volume information in UEFI terms.
 //
 // All client-side state lives in program-wide records, so the adapter is
 // not re-entrant and only one file may be open at a time.
@@ -25,8 +25,8 @@
 // pool to where it started.
 #pragma once
 
+#include "NwBackend.h"
 #include "smb2/SMB2FileAccess.h"
-#include "volume/NWLib.h"
 
 // Connect buffer sizes (bytes). The user and domain buffers carry one byte
 // beyond what the login splitter may fill, so that a name of the full length
@@ -38,7 +38,8 @@ constexpr UINTN SMB2_FS_DOMAIN_BUFFER = 256;
 constexpr UINTN SMB2_FS_SHARENAME_BUFFER = 336;
 constexpr UINTN SMB2_FS_LOGIN_CHARS = 510;
 constexpr UINTN SMB2_FS_SHARE_CHARS = 80;
-// Transfers are cut into requests of at most this many bytes.
+// Reads are cut into requests of at most this many bytes; a write is sent
+// as the one request it is handed (the volume hands over at most this much).
 constexpr UINT32 SMB2_FS_MAX_CHUNK = 64512;
 // The least an EFI_FILE_INFO handed out occupies: the volume copies this
 // much of it as its directory-entry record.

@@ -13,7 +13,7 @@ UINT8 SMB2ConnectionState;
 namespace {
 
 constexpr UINT8 kProtocolId[4] = {0xFE, 'S', 'M', 'B'};
-constexpr UINT64 kDrainChunk = 4096;
+constexpr UINT64 kDrainChunk = 512;
 
 UINT32 ByteSwap32(UINT32 Value) {
   return (Value >> 24) | ((Value >> 8) & 0xFF00) | ((Value << 8) & 0xFF0000) | (Value << 24);
@@ -100,7 +100,8 @@ UINT32 SMB2SendAll(INT32 SockFd, const UINT8 *Bytes, UINT64 Length, UINT32 *Tran
   INT32 Status = 0;
   while (Offset < Length) {
     INT64 Sent = 0;
-    Status = TCP_SendMessage(SockFd, Bytes + Offset, static_cast<INT64>(Length - Offset), &Sent);
+    Status =
+        TCP_PollAndSendMessage(SockFd, Bytes + Offset, static_cast<INT64>(Length - Offset), &Sent);
     if (Status == 0 && Sent <= 0) {
       Status = -1; // a send that moves nothing would never finish
     }
@@ -118,39 +119,6 @@ UINT32 SMB2SendAll(INT32 SockFd, const UINT8 *Bytes, UINT64 Length, UINT32 *Tran
     Smb2Log(DIAG_VERBOSE, "All bytes %ld written!\n", static_cast<INT64>(Offset));
   }
   return static_cast<UINT32>(Status);
-}
-
-UINT32 SMB2SendRequest(INT32 SockFd, const void *Request, UINT64 Length, UINT32 *TransportStatus) {
-  if (Request == nullptr || TransportStatus == nullptr) {
-    DiagNullInput();
-    return SMB2_NT_INVALID_PARAMETER;
-  }
-  if (Length == 0) {
-    DiagError("Error! Bytes to be sent is zero!", EFI_INVALID_PARAMETER);
-    return STATUS_UNSUCCESSFUL;
-  }
-  UINT8 *Copy = static_cast<UINT8 *>(AllocateZeroPool(Length + 1));
-  if (Copy == nullptr) {
-    SMB2PrintAllocFailure();
-    return STATUS_NO_MEMORY;
-  }
-  CopyMem(Copy, Request, Length);
-  UINT32 Status = SMB2SendAll(SockFd, Copy, Length, TransportStatus);
-  FreePool(Copy);
-  return Status;
-}
-
-UINT32 SMB2SendAndFree(INT32 SockFd, UINT8 *Packet, UINT64 Length, UINT32 *TransportStatus) {
-  UINT32 Sent = SMB2SendAll(SockFd, Packet, Length, TransportStatus);
-  if (Packet != nullptr) {
-    ZeroMem(Packet, Length);
-    FreePool(Packet);
-  }
-  return Sent;
-}
-
-UINT32 SMB2SendVerdict(UINT32 Sent) {
-  return Sent == SMB2_NT_SUCCESS || Sent == STATUS_NO_MEMORY ? Sent : STATUS_UNSUCCESSFUL;
 }
 
 EFI_STATUS SMB2VerifyHeader(const SMB2_HEADER *Header, TRANSACT_DETAILS *Details) {
@@ -220,15 +188,10 @@ UINT32 SMB2DrainBytes(INT32 SockFd, UINT64 Length, TRANSACT_DETAILS *Details, UI
   if (Length > SMB2_MAX_STREAM_LENGTH) {
     Length = SMB2_MAX_STREAM_LENGTH;
   }
-  UINT64 Chunk = Length < kDrainChunk ? Length : kDrainChunk;
-  UINT8 *Scratch = static_cast<UINT8 *>(AllocatePool(Chunk + 1));
-  if (Scratch == nullptr) {
-    Smb2Log(DIAG_ALWAYS, "Memory allocation failed!\n");
-    return STATUS_NO_MEMORY;
-  }
+  UINT8 Scratch[kDrainChunk];
   UINT32 Status = SMB2_NT_SUCCESS;
   while (Length > 0) {
-    UINT64 Piece = Length < Chunk ? Length : Chunk;
+    UINT64 Piece = Length < kDrainChunk ? Length : kDrainChunk;
     INT64 Got = 0;
     INT32 Rx = SMB2ReceiveAll(SockFd, Scratch, Piece, Details, &Got);
     if (Got > 0) {
@@ -240,7 +203,6 @@ UINT32 SMB2DrainBytes(INT32 SockFd, UINT64 Length, TRANSACT_DETAILS *Details, UI
     }
     Length -= Piece;
   }
-  FreePool(Scratch);
   return Status;
 }
 
@@ -327,12 +289,6 @@ EFI_STATUS SMB2ReadVerifyHeader(SMB2_HEADER *Header, TRANSACT_DETAILS *Details, 
 
 void SMB2PrintAllocFailure(const CHAR8 *Function, UINT32 Line) {
   Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Memory allocation failed!\n", Function, Line);
-}
-
-void SMB2PrintReceiveFailure(UINT32 Status, const CHAR8 *Function, UINT32 Line) {
-  Smb2Log(DIAG_ALWAYS,
-          "Function: %s, Line no.: = %d, TCP_PollAndReceiveMessage failed! Status = 0x%x\n",
-          Function, Line, Status);
 }
 
 EFI_STATUS SMB2MapNtStatus(UINT32 NtStatus, const CHAR8 *Callee, const CHAR8 *Function,

@@ -1,8 +1,8 @@
 // SMB2 framing shared by every command of the client: the 68-byte framed
 // header (4-byte stream length + 64-byte SMB2 header), the connection record
-// TransactDetails, message sequencing, the response-header check and read,
-// the send loop, and the mapping of the request layer's NT-style codes to
-// EFI_STATUS.
+// TransactDetails, the per-request header fields, the response-header check
+// and read, the send loop, and the mapping of the request layer's NT-style
+// codes to EFI_STATUS. The exchange path (SMB2Exchange.h) puts them together.
 //
 // Wire structures are packed and little-endian except the big-endian stream
 // length. Offsets in request structures count from the start of the framed
@@ -30,17 +30,20 @@ constexpr UINT32 SMB2_NT_OUT_OF_MEMORY = 0x8007000E;
 // ---------------------------------------------------------------------------
 // Commands, dialects, request structure sizes
 // ---------------------------------------------------------------------------
-constexpr UINT16 SMB2_NEGOTIATE = 0;
-constexpr UINT16 SMB2_SESSION_SETUP = 1;
-constexpr UINT16 SMB2_LOGOFF = 2;
-constexpr UINT16 SMB2_TREE_CONNECT = 3;
-constexpr UINT16 SMB2_TREE_DISCONNECT = 4;
-constexpr UINT16 SMB2_CREATE = 5;
-constexpr UINT16 SMB2_CLOSE = 6;
-constexpr UINT16 SMB2_READ = 8;
-constexpr UINT16 SMB2_WRITE = 9;
-constexpr UINT16 SMB2_QUERY_DIRECTORY = 14;
-constexpr UINT16 SMB2_QUERY_INFO = 16;
+// Command codes.
+enum : UINT16 {
+  SMB2_NEGOTIATE = 0,
+  SMB2_SESSION_SETUP = 1,
+  SMB2_LOGOFF = 2,
+  SMB2_TREE_CONNECT = 3,
+  SMB2_TREE_DISCONNECT = 4,
+  SMB2_CREATE = 5,
+  SMB2_CLOSE = 6,
+  SMB2_READ = 8,
+  SMB2_WRITE = 9,
+  SMB2_QUERY_DIRECTORY = 14,
+  SMB2_QUERY_INFO = 16,
+};
 
 constexpr UINT16 SMB2_DIALECT_202 = 0x0202;
 constexpr UINT16 SMB2_DIALECT_210 = 0x0210;
@@ -51,28 +54,13 @@ constexpr UINT16 SMB2_DIALECT_311 = 0x0311;
 
 constexpr UINT16 SMB2_HEADER_STRUCTURE_SIZE = 64;
 constexpr UINT16 SMB2_CREDIT_REQUEST = 2;
-constexpr UINT16 SMB2_NEGOTIATE_STRUCTURE_SIZE = 36;
-constexpr UINT16 SMB2_SESSION_SETUP_STRUCTURE_SIZE = 25;
-constexpr UINT16 SMB2_LOGOFF_STRUCTURE_SIZE = 4;
-constexpr UINT16 SMB2_TREE_CONNECT_STRUCTURE_SIZE = 9;
-constexpr UINT16 SMB2_TREE_DISCONNECT_STRUCTURE_SIZE = 4;
-constexpr UINT16 SMB2_CREATE_STRUCTURE_SIZE = 57;
-constexpr UINT16 SMB2_CLOSE_STRUCTURE_SIZE = 24;
-constexpr UINT16 SMB2_READ_STRUCTURE_SIZE = 49;
-constexpr UINT16 SMB2_WRITE_STRUCTURE_SIZE = 49;
-constexpr UINT16 SMB2_QUERY_DIRECTORY_STRUCTURE_SIZE = 33;
-constexpr UINT16 SMB2_QUERY_INFO_STRUCTURE_SIZE = 41;
-
-// Framing limits: the stream length of direct TCP is 24 bits; responses the
-// client buffers whole (negotiate, session setup, tree connect) are small,
-// and a larger announcement is refused rather than allocated.
-constexpr UINT32 SMB2_STREAM_PREFIX_SIZE = 4;
-constexpr UINT32 SMB2_MAX_STREAM_LENGTH = 0x00FFFFFF;
-constexpr UINT32 SMB2_MAX_BUFFERED_BODY = 0x10000;
-// A server that takes its time with a request first sends interim answers
-// (STATUS_PENDING); the header read quietly skips at most this many before
-// the final answer on the same message id.
-constexpr UINT32 SMB2_MAX_INTERIM_RESPONSES = 16;
+// The StructureSize each request body carries, by command code (commands
+// the client never sends have none).
+constexpr UINT16 SMB2_REQUEST_STRUCTURE_SIZE[SMB2_QUERY_INFO + 1] = {
+    36, 25, 4, 9, 4, 57, 24, 0, 49, 49, 0, 0, 0, 0, 33, 0, 41,
+};
+static_assert(SMB2_REQUEST_STRUCTURE_SIZE[SMB2_CREATE] == 57, "CREATE body size");
+static_assert(SMB2_REQUEST_STRUCTURE_SIZE[SMB2_QUERY_DIRECTORY] == 33, "QUERY_DIRECTORY body");
 
 // ---------------------------------------------------------------------------
 // Framed header
@@ -111,6 +99,16 @@ static_assert(offsetof(SMB2_HEADER, SessionId) == 44, "SessionId offset");
 static_assert(offsetof(SMB2_HEADER, Signature) == 52, "Signature offset");
 
 constexpr UINT32 SMB2_FRAMED_HEADER_SIZE = sizeof(SMB2_HEADER);
+// Framing limits: the stream length of direct TCP is 24 bits; responses the
+// client buffers whole (negotiate, session setup, tree connect) are small,
+// and a larger announcement is refused rather than allocated.
+constexpr UINT32 SMB2_STREAM_PREFIX_SIZE = 4;
+constexpr UINT32 SMB2_MAX_STREAM_LENGTH = 0x00FFFFFF;
+constexpr UINT32 SMB2_MAX_BUFFERED_BODY = 0x10000;
+// A server that takes its time with a request first sends interim answers
+// (STATUS_PENDING); the header read quietly skips at most this many before
+// the final answer on the same message id.
+constexpr UINT32 SMB2_MAX_INTERIM_RESPONSES = 16;
 
 // ---------------------------------------------------------------------------
 // The connection record
@@ -237,20 +235,11 @@ UINT16 SMB2CreditCharge(UINT16 Command, UINT32 Length, UINT16 Dialect);
 void SMB2HeaderFill(SMB2_HEADER *Header, UINT16 Command, UINT32 TotalLength,
                     const TRANSACT_DETAILS *Details, UINT32 DataLength = 0);
 
-// The send loop: copies the request into a fresh buffer and sends until all
-// bytes are out. Returns 0, STATUS_UNSUCCESSFUL for a zero length,
-// STATUS_NO_MEMORY, or the failing transport status (also stored in
-// *TransportStatus, which receives the last send's status in every case).
-UINT32 SMB2SendRequest(INT32 SockFd, const void *Request, UINT64 Length, UINT32 *TransportStatus);
-// The loop alone, for a request already assembled in a buffer of its own
-// (no further copy).
+// The send loop: sends until all Length bytes are out. Returns 0,
+// STATUS_UNSUCCESSFUL for a zero length, or the failing transport status
+// (also stored in *TransportStatus, which receives the last send's status in
+// every case).
 UINT32 SMB2SendAll(INT32 SockFd, const UINT8 *Bytes, UINT64 Length, UINT32 *TransportStatus);
-// The loop for a request built in pool memory, which is scrubbed and freed
-// afterwards.
-UINT32 SMB2SendAndFree(INT32 SockFd, UINT8 *Packet, UINT64 Length, UINT32 *TransportStatus);
-// The session exchanges' verdict on a send: success and STATUS_NO_MEMORY
-// stand, any transport failure becomes STATUS_UNSUCCESSFUL.
-UINT32 SMB2SendVerdict(UINT32 Sent);
 
 // ---------------------------------------------------------------------------
 // Reading responses
@@ -268,8 +257,8 @@ EFI_STATUS SMB2ReadVerifyHeader(SMB2_HEADER *Header, TRANSACT_DETAILS *Details, 
 INT32 SMB2ReceiveAll(INT32 SockFd, void *Buffer, UINT64 Length, TRANSACT_DETAILS *Details,
                      INT64 *Received = nullptr);
 // Reads and discards Length bytes in bounded pieces (at most the largest
-// stream a server may announce). Returns 0, STATUS_UNSUCCESSFUL or
-// STATUS_NO_MEMORY; *Drained gets the bytes consumed.
+// stream a server may announce). Returns 0 or STATUS_UNSUCCESSFUL; *Drained
+// gets the bytes consumed.
 UINT32 SMB2DrainBytes(INT32 SockFd, UINT64 Length, TRANSACT_DETAILS *Details,
                       UINT64 *Drained = nullptr);
 // Consumes the rest of a refused response (its body less BodyBytesRead) so
@@ -282,14 +271,10 @@ UINT32 SMB2DrainRefused(INT32 SockFd, const SMB2_HEADER *Header, UINT32 BodyByte
 // a stream shorter than a header.
 UINT32 SMB2BodyLength(const SMB2_HEADER *Header);
 
-// The two failure lines every request and response function shares:
-// "Function: %s, Line no.: = %d, Memory allocation failed!\n" and
-// "Function: %s, Line no.: = %d, TCP_PollAndReceiveMessage failed! Status = 0x%x\n",
-// naming the calling function and line.
+// "Function: %s, Line no.: = %d, Memory allocation failed!\n", naming the
+// calling function and line.
 void SMB2PrintAllocFailure(const CHAR8 *Function = __builtin_FUNCTION(),
                            UINT32 Line = __builtin_LINE());
-void SMB2PrintReceiveFailure(UINT32 Status, const CHAR8 *Function = __builtin_FUNCTION(),
-                             UINT32 Line = __builtin_LINE());
 
 // ---------------------------------------------------------------------------
 // Judging the request layer's NT-style codes

@@ -1,8 +1,8 @@
-// SMB2 NEGOTIATE: the TCP connection to the server's SMB port and the dialect
-// agreement (2.0.2 and 2.1 offered, only those accepted).
+// SMB2 NEGOTIATE: the dialect agreement (2.0.2 and 2.1 offered, only those
+// accepted) on the connection the transport has just opened.
 #pragma once
 
-#include "smb2/SMB2Header.h"
+#include "smb2/SMB2Exchange.h"
 
 #pragma pack(push, 1)
 struct SMB2_NEGOTIATE_REQUEST {
@@ -61,15 +61,18 @@ static_assert(offsetof(SMB2_NEGOTIATE_RESPONSE, SecurityBufferLength) == 126, "S
 constexpr UINT8 SMB2_CLIENT_GUID[16] = {0x29, 0xA6, 0xB1, 0xFC, 0x77, 0xF1, 0x38, 0x47,
                                         0xA6, 0x77, 0x37, 0xA3, 0xCB, 0x04, 0x8E, 0xBA};
 
+// The negotiate exchange works on the caller's 108-byte request area; the
+// dialect check's verdict is kept for the step to report.
+struct SMB2_NEGOTIATE_CONTEXT {
+  SMB2_NEGOTIATE_REQUEST *Request;
+  EFI_STATUS Verdict;
+};
+extern const SMB2_COMMAND gSMB2NegotiateCommand;
+
+// The whole step: the transport's connection, then the exchange.
 EFI_STATUS SMB2Negotiate(const CHAR8 *IpAddress, SMB2_NEGOTIATE_REQUEST *Request, INT32 *SockFd,
                          TRANSACT_DETAILS *Details);
-EFI_STATUS SMB2NegotiateConnect(const CHAR8 *IpAddress, INT32 *SockFd, TRANSACT_DETAILS *Details);
 EFI_STATUS SMB2NegotiatePacketConstruct(SMB2_NEGOTIATE_REQUEST *Request);
-UINT32 SMB2NegotiateRequest(SMB2_NEGOTIATE_REQUEST *Request, UINT32 *TransportStatus, INT32 SockFd);
-// On success *Response is a pool buffer of at least sizeof(SMB2_NEGOTIATE_
-// RESPONSE) bytes holding the whole message; the caller frees it.
-UINT32 SMB2NegotiateResponse(SMB2_NEGOTIATE_RESPONSE **Response, TRANSACT_DETAILS *Details,
-                             INT32 SockFd);
 EFI_STATUS SMB2VerifyExtractNegotiateResponse(const SMB2_NEGOTIATE_RESPONSE *Response,
                                               TRANSACT_DETAILS *Details);
 EFI_STATUS SMB2VerifyDialect(UINT16 Dialect);

@@ -1,5 +1,4 @@
-// The NTLMv2 one-way functions over the platform's MD4, HMAC-MD5 and RC4,
-// and the 8-bit to UTF-16 conversion every NTLM and SMB2 name goes through.
+// The NTLMv2 one-way functions over the platform's MD4, HMAC-MD5 and RC4.
 #include "DiagLog.h"
 #include "NwBaseLib.h"
 #include "smb2/SMB2Ntlmssp.h"
@@ -48,20 +47,6 @@ void ReportFailure(const CHAR8 *What, const CHAR8 *Function, UINT32 Line, bool L
 }
 
 } // namespace
-
-UINTN strtoUTF16(void *Out, const CHAR8 *Text, UINTN Maximum, const CHAR8 *Codepage) {
-  (void)Codepage; // "default" is the only character set: Latin-1, one byte per character
-  if (Out == nullptr || Text == nullptr) {
-    return 0;
-  }
-  UINT8 *Bytes = static_cast<UINT8 *>(Out);
-  UINTN Count = 0;
-  while (Count < Maximum && Text[Count] != '\0') {
-    PutUtf16(Bytes, Count, static_cast<UINT8>(Text[Count]));
-    Count++;
-  }
-  return Count;
-}
 
 EFI_STATUS CalcMD4(const void *Data, UINTN Length, UINT8 Digest[NTLM_HASH_SIZE]) {
   NwMd4Context *Ctx = static_cast<NwMd4Context *>(AllocateZeroPool(sizeof(NwMd4Context)));

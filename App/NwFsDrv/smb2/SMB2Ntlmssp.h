@@ -130,13 +130,6 @@ struct SMB2_NTLM_CHALLENGE {
 };
 
 // ---------------------------------------------------------------------------
-// Text conversion: 8-bit text in the "default" character set (Latin-1) to
-// UTF-16LE bytes. Writes at most Maximum characters (no terminator) and
-// returns the count written.
-// ---------------------------------------------------------------------------
-UINTN strtoUTF16(void *Out, const CHAR8 *Text, UINTN Maximum, const CHAR8 *Codepage);
-
-// ---------------------------------------------------------------------------
 // Cryptography
 // ---------------------------------------------------------------------------
 EFI_STATUS CalcMD4(const void *Data, UINTN Length, UINT8 Digest[NTLM_HASH_SIZE]);

@@ -1,6 +1,6 @@
 // SMB2 QUERY_DIRECTORY: one request per listing (at most one 16384-byte
-// answer, by design), and the walk that turns the answer into directory
-// nodes.
+// answer, by design): the encoder, the decoder, and the walk that turns the
+// answer into directory nodes.
 //
 // The walk trusts nothing in the answer: every entry's fixed part and name
 // must lie inside the answer, a name must fit inside its own entry, and
@@ -35,8 +35,8 @@ EFI_STATUS CheckEntry(const UINT8 *Base, UINT64 Length, UINT64 Offset, UINT32 *N
     return EFI_PROTOCOL_ERROR;
   }
   const UINT8 *Entry = Base + Offset;
-  UINT32 NameLength = SMB2ReadLe32(Entry + SMB2_FULL_DIR_NAME_LENGTH);
-  *Next = SMB2ReadLe32(Entry + SMB2_FULL_DIR_NEXT_OFFSET);
+  UINT32 NameLength = SMB2ReadLe32(Entry + offsetof(SMB2_FULL_DIR_ENTRY, FileNameLength));
+  *Next = SMB2ReadLe32(Entry + offsetof(SMB2_FULL_DIR_ENTRY, NextEntryOffset));
   if (NameLength > kNameLimit) {
     Smb2Log(DIAG_ALWAYS, "Error! FileNameLength %d is greater than limited %d length\n", NameLength,
             kNameLimit);
@@ -63,7 +63,7 @@ EFI_STATUS CheckEntry(const UINT8 *Base, UINT64 Length, UINT64 Offset, UINT32 *N
 
 // Makes one node of a checked entry and appends it.
 EFI_STATUS AppendEntry(const UINT8 *Entry, SMB2_DIR_NODE **Head) {
-  UINT32 NameLength = SMB2ReadLe32(Entry + SMB2_FULL_DIR_NAME_LENGTH);
+  UINT32 NameLength = SMB2ReadLe32(Entry + offsetof(SMB2_FULL_DIR_ENTRY, FileNameLength));
   UINTN NodeSize = ComputedNodeSize(NameLength);
   Smb2Log(DIAG_VERBOSE, "NodeSize = %ld\n", static_cast<INT64>(NodeSize));
   Smb2Log(DIAG_VERBOSE, "TotalNodeSize = %ld\n", static_cast<INT64>(NodeSize));
@@ -82,7 +82,41 @@ EFI_STATUS AppendEntry(const UINT8 *Entry, SMB2_DIR_NODE **Head) {
   return SMB2_PopulateDirInfo(Entry, Node);
 }
 
+UINT32 EncodeQueryDirectory(void *Context, TRANSACT_DETAILS *Details, SMB2_REQUEST *Request) {
+  SMB2_FILE_CONTEXT *File = static_cast<SMB2_FILE_CONTEXT *>(Context);
+  SMB2_QUERY_DIRECTORY_REQUEST *Packet = &File->Packet.QueryDirectory;
+  UINT32 Total = 0;
+  UINT32 Code = SMB2ConstructResult(
+      SMB2QueryDirPacketConstruct(Packet, Details, File->Query, File->Access, &Total),
+      "SMB2QueryDirPacketConstruct failed!", "SMB2QueryDirInfoRequest");
+  if (Code != SMB2_NT_SUCCESS) {
+    return Code;
+  }
+  SMB2LayRequest(Request, Packet, sizeof(*Packet), Total);
+  SMB2AddPiece(Request, File->Query->Buffer, Packet->FileNameLength);
+  return SMB2_NT_SUCCESS;
+}
+
 } // namespace
+
+const SMB2_COMMAND gSMB2QueryDirectoryCommand = {
+    SMB2_QUERY_DIRECTORY,
+    0,
+    sizeof(SMB2_QUERY_RESPONSE_BODY),
+    SMB2_QUERY_DIRECTORY_OUTPUT_LENGTH,
+    "SMB2QueryDirInfoRequest",
+    "SMB2QueryDirInfoResponse",
+    "Query Directory request send failed!",
+    &gSMB2FileReceiveTexts,
+    EncodeQueryDirectory,
+    nullptr,
+    SMB2DecodeQueryAnswer,
+};
+
+const SMB2_QUERY_ANSWER_TEXTS gSMB2QueryDirectoryTexts = {
+    SMB2_QUERY_DIRECTORY_OUTPUT_LENGTH, "QueryDirResp->OutputBufferLength is 0!\n",
+    "SMB2VerifyQueryDirResponse failed!", "SMB2VerifyQueryDirResponse logon failed!",
+    "SMB2QueryDirInfoResponse"};
 
 // ---------------------------------------------------------------------------
 // The exchange
@@ -100,8 +134,7 @@ EFI_STATUS SMB2QueryDirPacketConstruct(SMB2_QUERY_DIRECTORY_REQUEST *Packet,
   UINT32 Total = sizeof(SMB2_QUERY_DIRECTORY_REQUEST) + NameLength;
   ZeroMem(Packet, sizeof(*Packet));
   SMB2HeaderConstruct(&Packet->Header);
-  SMB2HeaderFill(&Packet->Header, SMB2_QUERY_DIRECTORY, Total, Details);
-  Packet->StructureSize = SMB2_QUERY_DIRECTORY_STRUCTURE_SIZE;
+  Packet->StructureSize = SMB2_REQUEST_STRUCTURE_SIZE[SMB2_QUERY_DIRECTORY];
   Packet->FileInformationClass = Query->FileInfoClass;
   Packet->Flags = static_cast<UINT8>(Query->Flags);
   Packet->FileIndex = 0;
@@ -112,61 +145,6 @@ EFI_STATUS SMB2QueryDirPacketConstruct(SMB2_QUERY_DIRECTORY_REQUEST *Packet,
   Smb2Log(DIAG_VERBOSE, "Sending FileInformationClass = 0x%x\n", Query->FileInfoClass);
   *TotalBytes = Total;
   return EFI_SUCCESS;
-}
-
-UINT32 SMB2QueryDirInfoRequest(SMB2_QUERY_DIRECTORY_REQUEST *Packet, TRANSACT_DETAILS *Details,
-                               const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access,
-                               INT32 SockFd) {
-  UINT32 Total = 0;
-  EFI_STATUS Status = SMB2QueryDirPacketConstruct(Packet, Details, Query, Access, &Total);
-  if (EFI_ERROR(Status)) {
-    DiagError("SMB2QueryDirPacketConstruct failed!", Status);
-    return SMB2ConstructFailureCode(Status);
-  }
-  const SMB2_SEND_PIECE Pieces[] = {{Packet, sizeof(*Packet)},
-                                    {Query->Buffer, Packet->FileNameLength}};
-  SMB2TraceRequest(&Packet->Header, Total, 0);
-  return SMB2SendFileRequest(SockFd, Pieces, Packet->FileNameLength != 0 ? 2 : 1, Total,
-                             "Query Directory");
-}
-
-UINT32 SMB2QueryDirInfoResponse(SMB2_QUERY_RESPONSE *Packet, TRANSACT_DETAILS *Details,
-                                const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access,
-                                INT32 SockFd) {
-  if (Packet == nullptr || Details == nullptr || Query == nullptr || Access == nullptr) {
-    DiagNullInput();
-    return SMB2_NT_INVALID_PARAMETER;
-  }
-  // A header status such as STATUS_NO_MORE_FILES fails the header check,
-  // and with it the listing.
-  const SMB2_QUERY_ANSWER_TEXTS Texts = {
-      SMB2_QUERY_DIRECTORY_OUTPUT_LENGTH, "QueryDirResp->OutputBufferLength is 0!\n",
-      "SMB2VerifyQueryDirResponse failed!", "SMB2VerifyQueryDirResponse logon failed!"};
-  return SMB2ReadQueryResponse(SockFd, Packet, Query, Access, Texts);
-}
-
-EFI_STATUS SMB2_DirInfo(SMB2ShareDetails *Share, SMB2_CLIENT_SESSION *Session,
-                        const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access) {
-  DiagEntry(DiagChannel::Smb2);
-  if (Share == nullptr || Session == nullptr || Query == nullptr || Access == nullptr) {
-    DiagNullInput();
-    return EFI_INVALID_PARAMETER;
-  }
-  SMB2_QUERY_DIRECTORY_REQUEST Request;
-  SMB2_QUERY_RESPONSE Response;
-  EFI_STATUS Status = SMB2RunFileOperation(
-      Access,
-      [&] {
-        return SMB2QueryDirInfoRequest(&Request, &TransactDetails, Query, Access, gSMB2SockFd);
-      },
-      "SMB2QueryDirInfoRequest",
-      [&] {
-        return SMB2QueryDirInfoResponse(&Response, &TransactDetails, Query, Access, gSMB2SockFd);
-      },
-      "SMB2QueryDirInfoResponse");
-  Share->LastStatus = TransactDetails.ResponseStatus;
-  DiagExit(Status, DiagChannel::Smb2);
-  return Status;
 }
 
 // ---------------------------------------------------------------------------
@@ -208,20 +186,20 @@ EFI_STATUS SMB2_PopulateDirInfo(const UINT8 *Entry, SMB2_DIR_NODE *Node) {
   if (Entry == nullptr || Node == nullptr) {
     return EFI_INVALID_PARAMETER;
   }
-  UINT32 NameLength = SMB2ReadLe32(Entry + SMB2_FULL_DIR_NAME_LENGTH);
+  UINT32 NameLength = SMB2ReadLe32(Entry + offsetof(SMB2_FULL_DIR_ENTRY, FileNameLength));
   if (NameLength >= kNodeNameRefusal) {
     return EFI_INVALID_PARAMETER;
   }
-  Node->FileIndex = SMB2ReadLe32(Entry + SMB2_FULL_DIR_FILE_INDEX);
-  Node->CreationTime = SMB2ReadLe64(Entry + SMB2_FULL_DIR_CREATION_TIME);
-  Node->LastAccessTime = SMB2ReadLe64(Entry + SMB2_FULL_DIR_LAST_ACCESS_TIME);
-  Node->LastWriteTime = SMB2ReadLe64(Entry + SMB2_FULL_DIR_LAST_WRITE_TIME);
-  Node->ChangeTime = SMB2ReadLe64(Entry + SMB2_FULL_DIR_CHANGE_TIME);
-  Node->EndOfFile = SMB2ReadLe64(Entry + SMB2_FULL_DIR_END_OF_FILE);
-  Node->AllocationSize = SMB2ReadLe64(Entry + SMB2_FULL_DIR_ALLOCATION_SIZE);
-  Node->FileAttributes = SMB2ReadLe32(Entry + SMB2_FULL_DIR_ATTRIBUTES);
+  Node->FileIndex = SMB2ReadLe32(Entry + offsetof(SMB2_FULL_DIR_ENTRY, FileIndex));
+  Node->CreationTime = SMB2ReadLe64(Entry + offsetof(SMB2_FULL_DIR_ENTRY, CreationTime));
+  Node->LastAccessTime = SMB2ReadLe64(Entry + offsetof(SMB2_FULL_DIR_ENTRY, LastAccessTime));
+  Node->LastWriteTime = SMB2ReadLe64(Entry + offsetof(SMB2_FULL_DIR_ENTRY, LastWriteTime));
+  Node->ChangeTime = SMB2ReadLe64(Entry + offsetof(SMB2_FULL_DIR_ENTRY, ChangeTime));
+  Node->EndOfFile = SMB2ReadLe64(Entry + offsetof(SMB2_FULL_DIR_ENTRY, EndOfFile));
+  Node->AllocationSize = SMB2ReadLe64(Entry + offsetof(SMB2_FULL_DIR_ENTRY, AllocationSize));
+  Node->FileAttributes = SMB2ReadLe32(Entry + offsetof(SMB2_FULL_DIR_ENTRY, FileAttributes));
   Node->FileNameLength = NameLength;
-  Node->EaSize = SMB2ReadLe32(Entry + SMB2_FULL_DIR_EA_SIZE);
+  Node->EaSize = SMB2ReadLe32(Entry + offsetof(SMB2_FULL_DIR_ENTRY, EaSize));
   ZeroMem(Node->FileName, kNodeNameField);
   CopyMem(Node->FileName, Entry + SMB2_FULL_DIR_NAME, NameLength);
   Smb2Log(DIAG_VERBOSE, "File Length = %d\n", NameLength);

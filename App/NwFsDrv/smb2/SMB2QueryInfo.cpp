@@ -1,5 +1,6 @@
-// SMB2 QUERY_INFO and the verification that stores an information answer
-// into FileAccessDetails (also used for directory answers).
+// SMB2 QUERY_INFO: the encoder, the decoder, and the verification that
+// stores an information answer into FileAccessDetails (also used for
+// directory answers).
 //
 // Ownership of the directory answer copies: DirInfoPtr and FullDirInfoPtr
 // belong to FileAccessDetails. Storing a new copy releases the one it
@@ -69,7 +70,42 @@ EFI_STATUS RefuseClass(FILE_ACCESS_DETAILS *Access, const CHAR8 *Message, UINT8 
   return EFI_NOT_FOUND;
 }
 
+UINT32 EncodeQueryInfo(void *Context, TRANSACT_DETAILS *Details, SMB2_REQUEST *Request) {
+  SMB2_FILE_CONTEXT *File = static_cast<SMB2_FILE_CONTEXT *>(Context);
+  SMB2_QUERY_INFO_REQUEST *Packet = &File->Packet.QueryInfo;
+  UINT32 Total = 0;
+  UINT32 Code = SMB2ConstructResult(
+      SMB2QueryInfoPacketConstruct(Packet, Details, File->Query, File->Access, &Total),
+      "SMB2QueryInfoPacketConstruct failed!", "SMB2QueryInfoRequest");
+  if (Code != SMB2_NT_SUCCESS) {
+    return Code;
+  }
+  const QUERY_DETAILS *Query = File->Query;
+  SMB2LayRequest(Request, Packet, sizeof(*Packet), Total);
+  SMB2AddPiece(Request, Query->Buffer, Query->Buffer != nullptr ? Query->InputBufferLength : 0);
+  return SMB2_NT_SUCCESS;
+}
+
 } // namespace
+
+const SMB2_COMMAND gSMB2QueryInfoCommand = {
+    SMB2_QUERY_INFO,
+    0,
+    sizeof(SMB2_QUERY_RESPONSE_BODY),
+    SMB2_QUERY_INFO_OUTPUT_LENGTH,
+    "SMB2QueryInfoRequest",
+    "SMB2QueryInfoResponse",
+    "Query Info request send failed!",
+    &gSMB2FileReceiveTexts,
+    EncodeQueryInfo,
+    nullptr,
+    SMB2DecodeQueryAnswer,
+};
+
+const SMB2_QUERY_ANSWER_TEXTS gSMB2QueryInfoTexts = {
+    SMB2_QUERY_INFO_OUTPUT_LENGTH, "QueryInfoResp->OutputBufferLength is 0!\n",
+    "SMB2VerifyInfoStructure failed!", "SMB2VerifyInfoStructure logon failed!",
+    "SMB2QueryInfoResponse"};
 
 EFI_STATUS SMB2VerifyInfoStructure(const SMB2_QUERY_RESPONSE *Packet, UINT8 *Output,
                                    const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access) {
@@ -93,8 +129,8 @@ EFI_STATUS SMB2VerifyInfoStructure(const SMB2_QUERY_RESPONSE *Packet, UINT8 *Out
     Access->FullDirInfoLength = Access->FullDirInfoPtr != nullptr ? Length : 0;
     if (Length >= SMB2_FULL_DIR_NAME) {
       Smb2Log(DIAG_VERBOSE, "NextEntryOffset = %d, FileNameLength = %d\n",
-              SMB2ReadLe32(Output + SMB2_FULL_DIR_NEXT_OFFSET),
-              SMB2ReadLe32(Output + SMB2_FULL_DIR_NAME_LENGTH));
+              SMB2ReadLe32(Output + offsetof(SMB2_FULL_DIR_ENTRY, NextEntryOffset)),
+              SMB2ReadLe32(Output + offsetof(SMB2_FULL_DIR_ENTRY, FileNameLength)));
     }
     return EFI_SUCCESS;
   }
@@ -125,56 +161,38 @@ EFI_STATUS SMB2VerifyInfoStructure(const SMB2_QUERY_RESPONSE *Packet, UINT8 *Out
   return EFI_SUCCESS;
 }
 
-UINT32 SMB2ReadQueryResponse(INT32 SockFd, SMB2_QUERY_RESPONSE *Packet, const QUERY_DETAILS *Query,
-                             FILE_ACCESS_DETAILS *Access, const SMB2_QUERY_ANSWER_TEXTS &Texts,
-                             const CHAR8 *Function, UINT32 Line) {
-  constexpr UINT32 kFixed = sizeof(SMB2_QUERY_RESPONSE_BODY);
-  UINT32 Code =
-      SMB2ReadResponseStart(SockFd, &Packet->Header, &Packet->Body, kFixed, true, Function, Line);
-  if (Code != SMB2_NT_SUCCESS) {
-    return Code;
-  }
-  UINT32 Length = Packet->Body.OutputBufferLength;
-  const UINT32 Limit = Texts.Limit;
+UINT32 SMB2DecodeQueryAnswer(void *Context, const SMB2_RESPONSE *Answer) {
+  SMB2_FILE_CONTEXT *File = static_cast<SMB2_FILE_CONTEXT *>(Context);
+  const SMB2_QUERY_ANSWER_TEXTS &Texts = *File->Answer;
+  const QUERY_DETAILS *Query = File->Query;
+  FILE_ACCESS_DETAILS *Access = File->Access;
+  SMB2_QUERY_RESPONSE Packet;
+  CopyMem(&Packet.Header, &Answer->Header, sizeof(Packet.Header));
+  CopyMem(&Packet.Body, Answer->Fixed, sizeof(Packet.Body));
+  UINT32 Length = Packet.Body.OutputBufferLength;
   if (Length == 0) {
     Smb2Log(DIAG_ALWAYS, "%s", Texts.Empty);
-    return SMB2DrainMessageRest(SockFd, &Packet->Header, kFixed);
+    return SMB2_NT_SUCCESS;
   }
-  UINT64 Announced = SMB2BodyLength(&Packet->Header) - kFixed;
-  if (Length > Announced || Length > Limit) {
+  // The output is taken to follow the fixed body directly.
+  UINT64 Announced = Answer->BodyLength - Answer->FixedLength;
+  if (Length > Announced || Length > Texts.Limit || Length > Answer->VariableLength) {
     Smb2Log(DIAG_ALWAYS,
             "Function: %s, Line no.: = %d, OutputBufferLength %u is beyond the %ld bytes that "
             "follow or the %u bytes asked for!\n",
-            Function, Line, Length, static_cast<INT64>(Announced), Limit);
-    SMB2DrainMessageRest(SockFd, &Packet->Header, kFixed);
+            Texts.Function, __LINE__, Length, static_cast<INT64>(Announced), Texts.Limit);
     return STATUS_UNSUCCESSFUL;
   }
-  UINT8 *Output = static_cast<UINT8 *>(AllocateZeroPool(static_cast<UINTN>(Length) + 1));
-  if (Output == nullptr) {
-    SMB2PrintAllocFailure(Function, Line);
-    SMB2DrainMessageRest(SockFd, &Packet->Header, kFixed);
-    return SMB2_NT_OUT_OF_MEMORY;
+  UINT32 Code = SMB2_NT_SUCCESS;
+  EFI_STATUS Status =
+      SMB2VerifyInfoStructure(&Packet, const_cast<UINT8 *>(Answer->Variable), Query, Access);
+  if (Status == EFI_SECURITY_VIOLATION) {
+    DiagError(Texts.LogonFailed, Status, Texts.Function, __LINE__);
+    Code = STATUS_LOGON_FAILURE;
+  } else if (EFI_ERROR(Status)) {
+    DiagError(Texts.Failed, Status, Texts.Function, __LINE__);
+    Code = STATUS_UNSUCCESSFUL;
   }
-  INT32 Rx = SMB2ReceiveAll(SockFd, Output, Length, &TransactDetails);
-  if (Rx != 0) {
-    Smb2Log(DIAG_ALWAYS,
-            "Function: %s, Line no.: = %d, TCP_PollAndTryToRxAllData failed! Status = %ld\n",
-            Function, Line, static_cast<INT64>(Rx));
-    Code = static_cast<UINT32>(Rx);
-  } else {
-    Code = SMB2DrainMessageRest(SockFd, &Packet->Header, kFixed + static_cast<UINT64>(Length));
-  }
-  if (Code == SMB2_NT_SUCCESS) {
-    EFI_STATUS Status = SMB2VerifyInfoStructure(Packet, Output, Query, Access);
-    if (Status == EFI_SECURITY_VIOLATION) {
-      DiagError(Texts.LogonFailed, Status, Function, Line);
-      Code = STATUS_LOGON_FAILURE;
-    } else if (EFI_ERROR(Status)) {
-      DiagError(Texts.Failed, Status, Function, Line);
-      Code = STATUS_UNSUCCESSFUL;
-    }
-  }
-  FreePool(Output);
   Access->RawFileInfo = nullptr;
   return Code;
 }
@@ -192,8 +210,7 @@ EFI_STATUS SMB2QueryInfoPacketConstruct(SMB2_QUERY_INFO_REQUEST *Packet,
   UINT32 Total = sizeof(SMB2_QUERY_INFO_REQUEST) + Query->InputBufferLength;
   ZeroMem(Packet, sizeof(*Packet));
   SMB2HeaderConstruct(&Packet->Header);
-  SMB2HeaderFill(&Packet->Header, SMB2_QUERY_INFO, Total, Details);
-  Packet->StructureSize = SMB2_QUERY_INFO_STRUCTURE_SIZE;
+  Packet->StructureSize = SMB2_REQUEST_STRUCTURE_SIZE[SMB2_QUERY_INFO];
   Packet->InfoType = Query->InfoType;
   Packet->FileInfoClass = Query->FileInfoClass;
   Packet->OutputBufferLength = SMB2_QUERY_INFO_OUTPUT_LENGTH;
@@ -209,53 +226,4 @@ EFI_STATUS SMB2QueryInfoPacketConstruct(SMB2_QUERY_INFO_REQUEST *Packet,
   CopyMem(Packet->FileId, Access->FileId, SMB2_FILE_ID_SIZE);
   *TotalBytes = Total;
   return EFI_SUCCESS;
-}
-
-UINT32 SMB2QueryInfoRequest(SMB2_QUERY_INFO_REQUEST *Packet, TRANSACT_DETAILS *Details,
-                            const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access, INT32 SockFd) {
-  UINT32 Total = 0;
-  EFI_STATUS Status = SMB2QueryInfoPacketConstruct(Packet, Details, Query, Access, &Total);
-  if (EFI_ERROR(Status)) {
-    DiagError("SMB2QueryInfoPacketConstruct failed!", Status);
-    return SMB2ConstructFailureCode(Status);
-  }
-  UINT32 InputLength = Query->Buffer != nullptr ? Query->InputBufferLength : 0;
-  const SMB2_SEND_PIECE Pieces[] = {{Packet, sizeof(*Packet)}, {Query->Buffer, InputLength}};
-  SMB2TraceRequest(&Packet->Header, Total, 0);
-  return SMB2SendFileRequest(SockFd, Pieces, Query->InputBufferLength != 0 ? 2 : 1, Total,
-                             "Query Info");
-}
-
-UINT32 SMB2QueryInfoResponse(SMB2_QUERY_RESPONSE *Packet, TRANSACT_DETAILS *Details,
-                             const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access,
-                             INT32 SockFd) {
-  if (Packet == nullptr || Details == nullptr || Query == nullptr || Access == nullptr) {
-    DiagNullInput();
-    return SMB2_NT_INVALID_PARAMETER;
-  }
-  const SMB2_QUERY_ANSWER_TEXTS Texts = {
-      SMB2_QUERY_INFO_OUTPUT_LENGTH, "QueryInfoResp->OutputBufferLength is 0!\n",
-      "SMB2VerifyInfoStructure failed!", "SMB2VerifyInfoStructure logon failed!"};
-  return SMB2ReadQueryResponse(SockFd, Packet, Query, Access, Texts);
-}
-
-EFI_STATUS SMB2_FSInfo(SMB2ShareDetails *Share, SMB2_CLIENT_SESSION *Session,
-                       const QUERY_DETAILS *Query, FILE_ACCESS_DETAILS *Access) {
-  DiagEntry(DiagChannel::Smb2);
-  if (Share == nullptr || Session == nullptr || Query == nullptr || Access == nullptr) {
-    DiagNullInput();
-    return EFI_INVALID_PARAMETER;
-  }
-  SMB2_QUERY_INFO_REQUEST Request;
-  SMB2_QUERY_RESPONSE Response;
-  EFI_STATUS Status = SMB2RunFileOperation(
-      Access,
-      [&] { return SMB2QueryInfoRequest(&Request, &TransactDetails, Query, Access, gSMB2SockFd); },
-      "SMB2QueryInfoRequest",
-      [&] {
-        return SMB2QueryInfoResponse(&Response, &TransactDetails, Query, Access, gSMB2SockFd);
-      },
-      "SMB2QueryInfoResponse");
-  DiagExit(Status, DiagChannel::Smb2);
-  return Status;
 }

@@ -1,8 +1,9 @@
 // The session exchanges of the SMB2 client: the two-leg SESSION_SETUP with
-// raw NTLMSSP, TREE_CONNECT, TREE_DISCONNECT and LOGOFF.
+// raw NTLMSSP, TREE_CONNECT, TREE_DISCONNECT and LOGOFF (their encoders and
+// decoders; the steps that run them are the connection's).
 #pragma once
 
-#include "smb2/SMB2Header.h"
+#include "smb2/SMB2Exchange.h"
 #include "smb2/SMB2Ntlmssp.h"
 
 #pragma pack(push, 1)
@@ -84,49 +85,50 @@ constexpr UINT16 SMB2_SESSION_SETUP_BUFFER_OFFSET =
 constexpr UINTN SMB2_SHARE_PATH_LIMIT = 336;
 
 // ---------------------------------------------------------------------------
-// Session setup
+// Session setup: two exchanges. The first carries the NTLMSSP NEGOTIATE and
+// takes in the server's CHALLENGE; the second carries the AUTHENTICATE.
 // ---------------------------------------------------------------------------
+struct SMB2_SESSION_CONTEXT {
+  SMB2_SESSION_SETUP_REQUEST Packet; // the fixed part of the request being sent
+  UINT8 Negotiate[sizeof(SMB2_NTLMSSP_NEGOTIATE_MESSAGE) + 1];
+  UINT8 *Authenticate; // pool, scrubbed when freed
+  UINT16 AuthenticateLength;
+  SMB2_NTLM_CHALLENGE Challenge;      // a pool copy of the server's CHALLENGE
+  SMB2_SESSION_SETUP_RESPONSE *First; // the first answer's header and fixed part
+};
+extern const SMB2_COMMAND gSMB2SessionNegotiateCommand;
+extern const SMB2_COMMAND gSMB2SessionAuthenticateCommand;
+
 // The whole exchange. *Response receives the first response's header and
 // fixed part.
 EFI_STATUS SMB2SessionSetUp(INT32 SockFd, SMB2_SESSION_SETUP_RESPONSE *Response,
                             TRANSACT_DETAILS *Details);
-// Lays a SESSION_SETUP request around a security blob into a new pool
-// buffer; the blob length passes through Details->SecurityBufferLength.
-EFI_STATUS SMB2SessionSetupPacketConstruct(const UINT8 *Blob, UINT16 BlobLength,
-                                           TRANSACT_DETAILS *Details, UINT8 **Packet,
-                                           UINT32 *Total);
-UINT32 SMB2SessionSetupRequest(INT32 SockFd, TRANSACT_DETAILS *Details);
-// Reads the first response; on success *Body is the pool buffer holding the
-// rest of the message and *Challenge points at the CHALLENGE inside it.
-UINT32 SMB2SessionChallengeResponse(INT32 SockFd, SMB2_SESSION_SETUP_RESPONSE *Response,
-                                    TRANSACT_DETAILS *Details, UINT8 **Body,
-                                    SMB2_NTLM_CHALLENGE *Challenge);
+// Fills the 92-byte fixed part of a SESSION_SETUP request whose security
+// buffer of BlobLength bytes follows it; the blob's place and length pass
+// through the record's SecurityBufferOffset and SecurityBufferLength.
+EFI_STATUS SMB2SessionSetupPacketConstruct(SMB2_SESSION_SETUP_REQUEST *Packet, UINT16 BlobLength,
+                                           TRANSACT_DETAILS *Details);
 EFI_STATUS SMB2VerifySetupChallengeResponse(const SMB2_SESSION_SETUP_RESPONSE *Response,
                                             const SMB2_NTLM_CHALLENGE *Challenge,
                                             TRANSACT_DETAILS *Details);
-EFI_STATUS SMB2NTLMSSPAuthenticatePacketConstruct(const SMB2_NTLM_CHALLENGE *Challenge,
-                                                  TRANSACT_DETAILS *Details, UINT8 **Packet,
-                                                  UINT32 *Total);
-UINT32 SMB2SessionNTLMRequest(INT32 SockFd, const SMB2_NTLM_CHALLENGE *Challenge,
-                              TRANSACT_DETAILS *Details);
-UINT32 SMB2SessionSetupResponse(INT32 SockFd, TRANSACT_DETAILS *Details);
 EFI_STATUS SMB2VerifySetupResponse(const SMB2_HEADER *Header, TRANSACT_DETAILS *Details);
 
 // ---------------------------------------------------------------------------
 // Tree connect, tree disconnect, logoff
 // ---------------------------------------------------------------------------
+struct SMB2_TREE_CONTEXT {
+  const CHAR8 *SharePath;
+  UINT8 *Packet; // the request with its UTF-16 path (pool)
+};
+extern const SMB2_COMMAND gSMB2TreeConnectCommand;
+extern const SMB2_COMMAND gSMB2TreeDisconnectCommand;
+extern const SMB2_COMMAND gSMB2LogOffCommand;
+
 EFI_STATUS SMB2TreeConnectPacketConstruct(const CHAR8 *SharePath, const TRANSACT_DETAILS *Details,
                                           UINT8 **Packet, UINT32 *Total);
-UINT32 SMB2TreeConnectRequest(const CHAR8 *SharePath, TRANSACT_DETAILS *Details, INT32 SockFd);
-UINT32 SMB2TreeConnectResponse(TRANSACT_DETAILS *Details, INT32 SockFd);
 UINT32 SMB2TreeConnect(const CHAR8 *SharePath, TRANSACT_DETAILS *Details, INT32 SockFd);
-
 EFI_STATUS SMB2TreeDisconnectPacketConstruct(SMB2_SIMPLE_REQUEST *Request,
                                              const TRANSACT_DETAILS *Details);
 EFI_STATUS SMB2LogOffPacketConstruct(SMB2_SIMPLE_REQUEST *Request, const TRANSACT_DETAILS *Details);
-UINT32 SMB2TreeDisconnectRequest(TRANSACT_DETAILS *Details, INT32 SockFd);
-UINT32 SMB2TreeDisconnectResponse(TRANSACT_DETAILS *Details, INT32 SockFd);
 UINT32 SMB2TreeDisconnect(TRANSACT_DETAILS *Details, INT32 SockFd);
-UINT32 SMB2LogOffRequest(TRANSACT_DETAILS *Details, INT32 SockFd);
-UINT32 SMB2LogOffResponse(TRANSACT_DETAILS *Details, INT32 SockFd);
 UINT32 SMB2LogOff(TRANSACT_DETAILS *Details, INT32 SockFd);

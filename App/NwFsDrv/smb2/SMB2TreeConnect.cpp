@@ -1,5 +1,6 @@
-// TREE_CONNECT to the share path, and the two teardown exchanges that
-// share one 72-byte request layout: TREE_DISCONNECT and LOGOFF.
+// TREE_CONNECT to the share path, and the two teardown exchanges that share
+// one 72-byte request layout: TREE_DISCONNECT and LOGOFF. Their encoders and
+// decoders.
 #include "DiagLog.h"
 #include "NwBaseLib.h"
 #include "smb2/SMB2Session.h"
@@ -7,66 +8,120 @@
 namespace {
 
 constexpr UINT16 kTreePathOffset = sizeof(SMB2_TREE_CONNECT_REQUEST) - SMB2_STREAM_PREFIX_SIZE;
-constexpr UINT32 kTreeResponseBody = sizeof(SMB2_TREE_CONNECT_RESPONSE) - SMB2_FRAMED_HEADER_SIZE;
+constexpr UINT16 kTreeResponseBody = sizeof(SMB2_TREE_CONNECT_RESPONSE) - SMB2_FRAMED_HEADER_SIZE;
 constexpr UINT32 kPathTerminatorBytes = 2;
 
-void SimpleRequestConstruct(SMB2_SIMPLE_REQUEST *Request, UINT16 Command, UINT16 StructureSize,
-                            const TRANSACT_DETAILS *Details) {
+void SimpleRequestConstruct(SMB2_SIMPLE_REQUEST *Request, UINT16 StructureSize) {
+  ZeroMem(Request, sizeof(*Request));
   SMB2HeaderConstruct(&Request->Header);
-  SMB2HeaderFill(&Request->Header, Command, sizeof(*Request), Details);
   Request->StructureSize = StructureSize;
-  Request->Reserved = 0;
 }
 
-// Raises the message id, builds and sends a TREE_DISCONNECT or LOGOFF.
-UINT32 SimpleRequest(UINT16 Command, TRANSACT_DETAILS *Details, INT32 SockFd) {
-  if (Details == nullptr) {
-    DiagNullInput();
-    return SMB2_NT_INVALID_PARAMETER;
-  }
-  Details->MessageId++;
-  SMB2_SIMPLE_REQUEST Request;
-  EFI_STATUS Status = Command == SMB2_LOGOFF ? SMB2LogOffPacketConstruct(&Request, Details)
-                                             : SMB2TreeDisconnectPacketConstruct(&Request, Details);
+UINT32 EncodeTreeConnect(void *Context, TRANSACT_DETAILS *Details, SMB2_REQUEST *Request) {
+  SMB2_TREE_CONTEXT *Tree = static_cast<SMB2_TREE_CONTEXT *>(Context);
+  UINT32 Total = 0;
+  EFI_STATUS Status =
+      SMB2TreeConnectPacketConstruct(Tree->SharePath, Details, &Tree->Packet, &Total);
   if (EFI_ERROR(Status)) {
-    DiagError(Command == SMB2_LOGOFF ? "SMB2LogOffPacketConstruct failed!"
-                                     : "SMB2TreeDisconnectPacketConstruct failed!",
-              Status);
+    DiagError("SMB2TreeConnectPacketConstruct failed!", Status, "SMB2TreeConnectRequest", __LINE__);
+    return Status == EFI_OUT_OF_RESOURCES ? STATUS_NO_MEMORY : STATUS_UNSUCCESSFUL;
+  }
+  SMB2LayRequest(Request, Tree->Packet, Total, Total);
+  return SMB2_NT_SUCCESS;
+}
+
+UINT32 DecodeTreeConnect(void *Context, const SMB2_RESPONSE *Answer) {
+  (void)Context;
+  SMB2_TREE_CONNECT_RESPONSE Response;
+  CopyMem(&Response.Header, &Answer->Header, sizeof(Response.Header));
+  CopyMem(reinterpret_cast<UINT8 *>(&Response) + sizeof(SMB2_HEADER), Answer->Fixed,
+          kTreeResponseBody);
+  // The share's type, flags, capabilities and access are shown, not kept.
+  Smb2Log(DIAG_VERBOSE, "TreeConnectResp->ShareType = 0x%x\n", Response.ShareType);
+  Smb2Log(DIAG_VERBOSE, "TreeConnectResp->ShareFlags = 0x%x\n", Response.ShareFlags);
+  Smb2Log(DIAG_VERBOSE, "TreeConnectResp->Capabilities = 0x%x\n", Response.Capabilities);
+  Smb2Log(DIAG_VERBOSE, "TreeConnectResp->MaximalAccess = 0x%x\n", Response.MaximalAccess);
+  TransactDetails.TreeId = Response.Header.TreeId;
+  Smb2Log(DIAG_VERBOSE, "TransactDetails->TreeId = 0x%x\n", TransactDetails.TreeId);
+  return SMB2_NT_SUCCESS;
+}
+
+// TREE_DISCONNECT and LOGOFF: the context is the caller's 72-byte request.
+UINT32 EncodeSimple(void *Context, SMB2_REQUEST *Request,
+                    EFI_STATUS (*Construct)(SMB2_SIMPLE_REQUEST *, const TRANSACT_DETAILS *),
+                    const CHAR8 *Failed, const CHAR8 *Function) {
+  SMB2_SIMPLE_REQUEST *Packet = static_cast<SMB2_SIMPLE_REQUEST *>(Context);
+  EFI_STATUS Status = Construct(Packet, &TransactDetails);
+  if (EFI_ERROR(Status)) {
+    DiagError(Failed, Status, Function, __LINE__);
     return STATUS_UNSUCCESSFUL;
   }
-  UINT32 Sent = SMB2SendRequest(SockFd, &Request, sizeof(Request), &Details->TransportStatus);
-  if (Sent != SMB2_NT_SUCCESS) {
-    Smb2Log(DIAG_ALWAYS,
-            Command == SMB2_LOGOFF
-                ? "Function: %s, Line no.: = %d, Logoff request send failed! Status = 0x%x (%d)\n"
-                : "Function: %s, Line no.: = %d, Tree disconnect send failed! Status = 0x%x (%d)\n",
-            __func__, __LINE__, Sent, Sent);
-  }
-  return SMB2SendVerdict(Sent);
+  SMB2LayRequest(Request, Packet, sizeof(*Packet), sizeof(*Packet));
+  return SMB2_NT_SUCCESS;
 }
 
-// Reads a TREE_DISCONNECT or LOGOFF response: the checked header, then the
-// rest of the message, which carries nothing the client uses.
-UINT32 SimpleResponse(TRANSACT_DETAILS *Details, INT32 SockFd, const CHAR8 *Function) {
-  if (Details == nullptr) {
-    DiagNullInput();
-    return SMB2_NT_INVALID_PARAMETER;
-  }
-  SMB2_HEADER Header;
-  UINT32 Nt = STATUS_UNSUCCESSFUL;
-  EFI_STATUS Status = SMB2ReadVerifyHeader(&Header, Details, SockFd, &Nt);
-  if (EFI_ERROR(Status)) {
-    if (Status == EFI_PROTOCOL_ERROR) {
-      SMB2PrintReceiveFailure(Details->TransportStatus, Function, __LINE__);
-    }
-  } else if (SMB2DrainBytes(SockFd, SMB2BodyLength(&Header), Details) != SMB2_NT_SUCCESS) {
-    Nt = STATUS_UNSUCCESSFUL;
-  }
-  Smb2Log(DIAG_TRACE, "Exiting %s, Status = 0x%lx\n", Function, static_cast<UINT64>(Nt));
-  return Nt;
+UINT32 EncodeTreeDisconnect(void *Context, TRANSACT_DETAILS *Details, SMB2_REQUEST *Request) {
+  (void)Details;
+  return EncodeSimple(Context, Request, SMB2TreeDisconnectPacketConstruct,
+                      "SMB2TreeDisconnectPacketConstruct failed!", "SMB2TreeDisconnectRequest");
 }
+
+UINT32 EncodeLogOff(void *Context, TRANSACT_DETAILS *Details, SMB2_REQUEST *Request) {
+  (void)Details;
+  return EncodeSimple(Context, Request, SMB2LogOffPacketConstruct,
+                      "SMB2LogOffPacketConstruct failed!", "SMB2LogOffRequest");
+}
+
+constexpr const CHAR8 *kReceiveFailed =
+    "Function: %s, Line no.: = %d, TCP_PollAndReceiveMessage failed! Status = 0x%x\n";
+
+const SMB2_RECEIVE_TEXTS kTeardownTexts = {
+    nullptr, kReceiveFailed, nullptr, DIAG_ALWAYS, kReceiveFailed, false, nullptr,
+};
 
 } // namespace
+
+const SMB2_COMMAND gSMB2TreeConnectCommand = {
+    SMB2_TREE_CONNECT,
+    SMB2_COMMAND_SESSION_CODES,
+    kTreeResponseBody,
+    0,
+    "SMB2TreeConnectRequest",
+    "SMB2TreeConnectResponse",
+    "Tree connect request send failed!",
+    &gSMB2SessionReceiveTexts,
+    EncodeTreeConnect,
+    nullptr,
+    DecodeTreeConnect,
+};
+
+const SMB2_COMMAND gSMB2TreeDisconnectCommand = {
+    SMB2_TREE_DISCONNECT,
+    SMB2_COMMAND_SESSION_CODES,
+    0,
+    0,
+    "SMB2TreeDisconnectRequest",
+    "SMB2TreeDisconnectResponse",
+    "Tree disconnect send failed!",
+    &kTeardownTexts,
+    EncodeTreeDisconnect,
+    nullptr,
+    SMB2DecodeNothing,
+};
+
+const SMB2_COMMAND gSMB2LogOffCommand = {
+    SMB2_LOGOFF,
+    SMB2_COMMAND_SESSION_CODES,
+    0,
+    0,
+    "SMB2LogOffRequest",
+    "SMB2LogOffResponse",
+    "Logoff request send failed!",
+    &kTeardownTexts,
+    EncodeLogOff,
+    nullptr,
+    SMB2DecodeNothing,
+};
 
 EFI_STATUS SMB2TreeConnectPacketConstruct(const CHAR8 *SharePath, const TRANSACT_DETAILS *Details,
                                           UINT8 **Packet, UINT32 *Total) {
@@ -92,89 +147,15 @@ EFI_STATUS SMB2TreeConnectPacketConstruct(const CHAR8 *SharePath, const TRANSACT
   }
   UINT16 PathLength = static_cast<UINT16>(
       strtoUTF16(Buffer + sizeof(SMB2_TREE_CONNECT_REQUEST), SharePath, Chars, "default") * 2);
-  UINT32 Length = PathLength + sizeof(SMB2_TREE_CONNECT_REQUEST) + kPathTerminatorBytes;
   SMB2_TREE_CONNECT_REQUEST *Request = reinterpret_cast<SMB2_TREE_CONNECT_REQUEST *>(Buffer);
   SMB2HeaderConstruct(&Request->Header);
-  SMB2HeaderFill(&Request->Header, SMB2_TREE_CONNECT, Length, Details);
-  Request->StructureSize = SMB2_TREE_CONNECT_STRUCTURE_SIZE;
+  Request->StructureSize = SMB2_REQUEST_STRUCTURE_SIZE[SMB2_TREE_CONNECT];
   Request->Reserved = 0;
   Request->PathOffset = kTreePathOffset;
   Request->PathLength = PathLength;
   *Packet = Buffer;
-  *Total = Length;
+  *Total = PathLength + sizeof(SMB2_TREE_CONNECT_REQUEST) + kPathTerminatorBytes;
   return EFI_SUCCESS;
-}
-
-UINT32 SMB2TreeConnectRequest(const CHAR8 *SharePath, TRANSACT_DETAILS *Details, INT32 SockFd) {
-  if (SharePath == nullptr || Details == nullptr) {
-    DiagNullInput();
-    return SMB2_NT_INVALID_PARAMETER;
-  }
-  UINT8 *Packet = nullptr;
-  UINT32 Total = 0;
-  EFI_STATUS Status = SMB2TreeConnectPacketConstruct(SharePath, Details, &Packet, &Total);
-  if (EFI_ERROR(Status)) {
-    DiagError("SMB2TreeConnectPacketConstruct failed!", Status);
-    return Status == EFI_OUT_OF_RESOURCES ? STATUS_NO_MEMORY : STATUS_UNSUCCESSFUL;
-  }
-  UINT32 Sent = SMB2SendAndFree(SockFd, Packet, Total, &Details->TransportStatus);
-  if (Sent != SMB2_NT_SUCCESS) {
-    Smb2Log(DIAG_ALWAYS,
-            "Function: %s, Line no.: = %d, Tree connect request send failed! Status = 0x%x (%d)\n",
-            __func__, __LINE__, Sent, Sent);
-  }
-  return SMB2SendVerdict(Sent);
-}
-
-UINT32 SMB2TreeConnectResponse(TRANSACT_DETAILS *Details, INT32 SockFd) {
-  if (Details == nullptr) {
-    DiagNullInput();
-    return SMB2_NT_INVALID_PARAMETER;
-  }
-  SMB2_TREE_CONNECT_RESPONSE Response;
-  UINT32 Nt = STATUS_UNSUCCESSFUL;
-  EFI_STATUS Status = SMB2ReadVerifyHeader(&Response.Header, Details, SockFd, &Nt);
-  if (EFI_ERROR(Status)) {
-    DiagError("SMB2ReadVerifyHeader failed!", Status);
-    return Nt;
-  }
-  UINT32 Body = SMB2BodyLength(&Response.Header);
-  if (Body < kTreeResponseBody) {
-    Smb2Log(DIAG_ALWAYS,
-            "Function: %s, Line no.: = %d, Tree connect response of 0x%x bytes is too short!\n",
-            __func__, __LINE__, Body);
-    SMB2DrainBytes(SockFd, Body, Details);
-    return STATUS_UNSUCCESSFUL;
-  }
-  UINT8 *Fixed = reinterpret_cast<UINT8 *>(&Response) + SMB2_FRAMED_HEADER_SIZE;
-  if (SMB2ReceiveAll(SockFd, Fixed, kTreeResponseBody, Details) != 0 ||
-      SMB2DrainBytes(SockFd, Body - kTreeResponseBody, Details) != SMB2_NT_SUCCESS) {
-    SMB2PrintReceiveFailure(Details->TransportStatus);
-    return STATUS_UNSUCCESSFUL;
-  }
-  // The share's type, flags, capabilities and access are shown, not kept.
-  Smb2Log(DIAG_VERBOSE, "TreeConnectResp->ShareType = 0x%x\n", Response.ShareType);
-  Smb2Log(DIAG_VERBOSE, "TreeConnectResp->ShareFlags = 0x%x\n", Response.ShareFlags);
-  Smb2Log(DIAG_VERBOSE, "TreeConnectResp->Capabilities = 0x%x\n", Response.Capabilities);
-  Smb2Log(DIAG_VERBOSE, "TreeConnectResp->MaximalAccess = 0x%x\n", Response.MaximalAccess);
-  Details->TreeId = Response.Header.TreeId;
-  Smb2Log(DIAG_VERBOSE, "TransactDetails->TreeId = 0x%x\n", Details->TreeId);
-  return SMB2_NT_SUCCESS;
-}
-
-UINT32 SMB2TreeConnect(const CHAR8 *SharePath, TRANSACT_DETAILS *Details, INT32 SockFd) {
-  DiagEntry(DiagChannel::Smb2);
-  UINT32 Nt = SMB2TreeConnectRequest(SharePath, Details, SockFd);
-  EFI_STATUS Status = SMB2MapNtStatus(Nt, "SMB2TreeConnectRequest");
-  if (!EFI_ERROR(Status)) {
-    Nt = SMB2TreeConnectResponse(Details, SockFd);
-    Status = SMB2MapNtStatus(Nt, "SMB2TreeConnectResponse");
-  }
-  if (!EFI_ERROR(Status)) {
-    SMB2ConnectionState = SMB2_STATE_TREE;
-  }
-  DiagExit(Status, DiagChannel::Smb2);
-  return Nt;
 }
 
 EFI_STATUS SMB2TreeDisconnectPacketConstruct(SMB2_SIMPLE_REQUEST *Request,
@@ -183,8 +164,7 @@ EFI_STATUS SMB2TreeDisconnectPacketConstruct(SMB2_SIMPLE_REQUEST *Request,
     DiagNullInput();
     return EFI_INVALID_PARAMETER;
   }
-  SimpleRequestConstruct(Request, SMB2_TREE_DISCONNECT, SMB2_TREE_DISCONNECT_STRUCTURE_SIZE,
-                         Details);
+  SimpleRequestConstruct(Request, SMB2_REQUEST_STRUCTURE_SIZE[SMB2_TREE_DISCONNECT]);
   Smb2Log(DIAG_VERBOSE, "SMB2_TREE_DISCONNECT_STRUCTURE_SIZE = 0x%x\n", Request->StructureSize);
   return EFI_SUCCESS;
 }
@@ -195,47 +175,7 @@ EFI_STATUS SMB2LogOffPacketConstruct(SMB2_SIMPLE_REQUEST *Request,
     DiagNullInput();
     return EFI_INVALID_PARAMETER;
   }
-  SimpleRequestConstruct(Request, SMB2_LOGOFF, SMB2_LOGOFF_STRUCTURE_SIZE, Details);
+  SimpleRequestConstruct(Request, SMB2_REQUEST_STRUCTURE_SIZE[SMB2_LOGOFF]);
   Smb2Log(DIAG_VERBOSE, "SMB2_LOGOFF_STRUCTURE_SIZE = 0x%x\n", Request->StructureSize);
   return EFI_SUCCESS;
-}
-
-UINT32 SMB2TreeDisconnectRequest(TRANSACT_DETAILS *Details, INT32 SockFd) {
-  return SimpleRequest(SMB2_TREE_DISCONNECT, Details, SockFd);
-}
-
-UINT32 SMB2TreeDisconnectResponse(TRANSACT_DETAILS *Details, INT32 SockFd) {
-  return SimpleResponse(Details, SockFd, __func__);
-}
-
-UINT32 SMB2LogOffRequest(TRANSACT_DETAILS *Details, INT32 SockFd) {
-  return SimpleRequest(SMB2_LOGOFF, Details, SockFd);
-}
-
-UINT32 SMB2LogOffResponse(TRANSACT_DETAILS *Details, INT32 SockFd) {
-  return SimpleResponse(Details, SockFd, __func__);
-}
-
-UINT32 SMB2TreeDisconnect(TRANSACT_DETAILS *Details, INT32 SockFd) {
-  UINT32 Nt = SMB2TreeDisconnectRequest(Details, SockFd);
-  if (EFI_ERROR(SMB2MapNtStatus(Nt, "SMB2TreeDisconnectRequest"))) {
-    return Nt;
-  }
-  Nt = SMB2TreeDisconnectResponse(Details, SockFd);
-  if (!EFI_ERROR(SMB2MapNtStatus(Nt, "SMB2TreeDisconnectResponse"))) {
-    SMB2ConnectionState = SMB2_STATE_TREE_DISCONNECTED;
-  }
-  return Nt;
-}
-
-UINT32 SMB2LogOff(TRANSACT_DETAILS *Details, INT32 SockFd) {
-  UINT32 Nt = SMB2LogOffRequest(Details, SockFd);
-  if (EFI_ERROR(SMB2MapNtStatus(Nt, "SMB2LogOffRequest"))) {
-    return Nt;
-  }
-  Nt = SMB2LogOffResponse(Details, SockFd);
-  if (!EFI_ERROR(SMB2MapNtStatus(Nt, "SMB2LogOffResponse"))) {
-    SMB2ConnectionState = SMB2_STATE_LOGGED_OFF;
-  }
-  return Nt;
 }

@@ -7,6 +7,7 @@
 
 #include "DiagLog.h"
 #include "NwBaseLib.h"
+#include "smb2/SMB2Header.h"
 
 namespace {
 
@@ -283,4 +284,66 @@ INT32 TCP_CloseSocket(INT32 SockFd) {
     TcpLog(DIAG_ALWAYS, "Socket close failed! errno = %d (%s)\n", Err, NwStrError(Err));
   }
   return Result;
+}
+
+// ---------------------------------------------------------------------------
+// The SMB2 client's connection
+// ---------------------------------------------------------------------------
+EFI_STATUS SMB2NegotiateConnect(const CHAR8 *IpAddress, INT32 *SockFd, TRANSACT_DETAILS *Details) {
+  DiagEntry(DiagChannel::Smb2);
+  if (IpAddress == nullptr || SockFd == nullptr || Details == nullptr) {
+    Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Invalid Parameter!\n", __func__, __LINE__);
+    return EFI_INVALID_PARAMETER;
+  }
+  NwSockAddrIn Addr4;
+  NwSockAddrIn6 Addr6;
+  ZeroMem(&Addr4, sizeof(Addr4));
+  ZeroMem(&Addr6, sizeof(Addr6));
+  INT32 Domain = 0;
+  INT32 TcpStatus =
+      TCP_GetDomainTypeByIPAddress(IpAddress, &Domain, SMB2_SERVER_PORT, &Addr4, &Addr6);
+  if (TcpStatus != 0) {
+    Smb2Log(DIAG_ALWAYS,
+            "Function: %s, Line no.: = %d, TCP_GetDomainTypeByIPAddress failed! Status = 0x%x "
+            "(%d)\n",
+            __func__, __LINE__, TcpStatus, TcpStatus);
+    return EFI_DEVICE_ERROR;
+  }
+  Smb2Log(DIAG_VERBOSE, "Domain = %d\n", Domain);
+  INT32 Fd = 0;
+  TcpStatus = TCP_CreateSocket(&Fd, Domain);
+  if (TcpStatus != 0) {
+    Smb2Log(DIAG_ALWAYS,
+            "Function: %s, Line no.: = %d, TCP socket failed! TCP_Status = 0x%x (%d)\n", __func__,
+            __LINE__, TcpStatus, TcpStatus);
+    return EFI_DEVICE_ERROR;
+  }
+  Smb2Log(DIAG_VERBOSE, "SockFd = %d\n", Fd);
+  gSMB2SockFd = Fd;
+  *SockFd = Fd;
+
+  // TCP_Connect gets the keep-alive option prepared but its flag off, so no
+  // option is set.
+  constexpr INT32 kOptionLevel = NW_SOL_SOCKET;
+  constexpr INT32 kOptionName = 0x200;
+  constexpr INT32 kOptionValue = 1;
+  CHAR8 *Formatted = Details->ShareDetails.FormattedAddress;
+  if (Domain == NW_AF_INET) {
+    Smb2Log(DIAG_VERBOSE, "SocketAddr.sin_family = %d\n", Addr4.sin_family);
+    Smb2Log(DIAG_VERBOSE, "SocketAddr.sin_port = %d\n", Addr4.sin_port);
+    AsciiSPrint(Formatted, SMB2_FORMATTED_ADDRESS_FIELD, "%pI4", Addr4.sin_addr);
+    TcpStatus = TCP_Connect(Fd, 0, kOptionLevel, kOptionName, kOptionValue, &Addr4, sizeof(Addr4));
+  } else if (Domain == NW_AF_INET6) {
+    Smb2Log(DIAG_VERBOSE, "SocketAddr6.sin_family = %d\n", Addr6.sin6_family);
+    Smb2Log(DIAG_VERBOSE, "SocketAddr6.sin_port = %d\n", Addr6.sin6_port);
+    AsciiSPrint(Formatted, SMB2_FORMATTED_ADDRESS_FIELD, "%pI6", Addr6.sin6_addr);
+    TcpStatus = TCP_Connect(Fd, 0, kOptionLevel, kOptionName, kOptionValue, &Addr6, sizeof(Addr6));
+  } else {
+    Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Invalid Domain %d\n", __func__, __LINE__,
+            Domain);
+    return EFI_UNSUPPORTED;
+  }
+  EFI_STATUS Status = TcpStatus == -1 ? EFI_DEVICE_ERROR : EFI_SUCCESS;
+  DiagExit(Status, DiagChannel::Smb2);
+  return Status;
 }

@@ -1,6 +1,7 @@
 // The TCP transport under the SMB2 client: address parsing, socket creation
 // and connect, and moving message bytes. Results are socket-style integers
-// (0 success, -1 or a BSD errno value on failure), not EFI_STATUS.
+// (0 success, -1 or a BSD errno value on failure), not EFI_STATUS; the
+// opening of the SMB2 client's connection reports EFI_STATUS.
 #pragma once
 
 #include "NwPlatform.h"
@@ -22,3 +23,11 @@ INT32 TCP_PollAndReceiveMessage(INT32 SockFd, void *Buffer, INT64 Size, INT64 *R
 INT32 TCP_PollAndTryToRxAllData(INT32 SockFd, void *Buffer, INT64 Size, UINT8 LoopCount,
                                 INT64 *TotalRead);
 INT32 TCP_CloseSocket(INT32 SockFd);
+
+struct TRANSACT_DETAILS;
+// Opens the SMB2 client's connection to the server's port 445: parses the
+// address text, creates the socket (kept in gSMB2SockFd and *SockFd),
+// formats the parsed address into the record and connects. Only a connect
+// result of -1 is a failure (EFI_DEVICE_ERROR); a failure after the socket
+// was created leaves it open.
+EFI_STATUS SMB2NegotiateConnect(const CHAR8 *IpAddress, INT32 *SockFd, TRANSACT_DETAILS *Details);

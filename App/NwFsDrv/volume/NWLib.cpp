@@ -1,15 +1,14 @@
-// The network library: every GEE_NW... operation forwards to the SMB2
-// file-system adapter and, for most of them, records its status in the
-// volatile provisioning variable. Also the network busy lock, the login
-// splitter, the fixed file time and the directory-node list helpers.
+// The network library: every GEE_NW... operation forwards to the back end
+// through its table and, for most of them, records its status in the
+// volatile provisioning variable. Also the network busy lock.
 #include "volume/NWLib.h"
 
 #include "DiagLog.h"
 #include "NwBaseLib.h"
 #include "ProvisioningVars.h"
-#include "smb2/SMB2FsAdapter.h"
 
 NETWORK_BUSY_LOCK NetworkBusyLock;
+const NW_BACKEND *gNwBackend = &gSMB2FsBackend;
 
 namespace {
 
@@ -18,12 +17,6 @@ namespace {
 EFI_STATUS Recorded(EFI_STATUS Status) {
   SetOperationStatus(Status);
   return Status;
-}
-
-void CopyPart(CHAR8 *Destination, const CHAR8 *Source, UINTN Length) {
-  for (UINTN I = 0; I < Length; I++) {
-    Destination[I] = Source[I];
-  }
 }
 
 } // namespace
@@ -60,9 +53,9 @@ EFI_STATUS SetOperationStatus(EFI_STATUS Status) {
 EFI_STATUS GEE_NWInit(EFI_HANDLE ImageHandle, EFI_SYSTEM_TABLE *SystemTable, UINT64 ShareType) {
   (void)ImageHandle;
   (void)SystemTable;
-  (void)ShareType; // every share type reaches the SMB2 adapter
+  (void)ShareType; // every share type reaches the one back end
   // The initialised flag is the mount code's, set there on success.
-  if (EFI_ERROR(SMB2_FSResetState())) {
+  if (EFI_ERROR(gNwBackend->Reset())) {
     return EFI_DEVICE_ERROR;
   }
   return EFI_SUCCESS;
@@ -70,11 +63,11 @@ EFI_STATUS GEE_NWInit(EFI_HANDLE ImageHandle, EFI_SYSTEM_TABLE *SystemTable, UIN
 
 EFI_STATUS GEE_NWDeInit(UINT64 ShareType) {
   (void)ShareType;
-  return SMB2_FSResetState();
+  return gNwBackend->Reset();
 }
 
 EFI_STATUS GEE_NWFSConnect(NW_CONNECTION_PARAMS *Params, NW_SHARE_INFO *Share) {
-  EFI_STATUS Status = SMB2_FSConnect(Params, Share);
+  EFI_STATUS Status = gNwBackend->Connect(Params, Share);
   DiagShortExit(Status, '.', DiagChannel::Driver, "GEE_NWFSConnect");
   return Status;
 }
@@ -82,12 +75,12 @@ EFI_STATUS GEE_NWFSConnect(NW_CONNECTION_PARAMS *Params, NW_SHARE_INFO *Share) {
 EFI_STATUS GEE_NWFSDisconnect(NW_SHARE_INFO *Share, const void *Unused) {
   (void)Share;
   (void)Unused;
-  return SMB2_FSDisconnect();
+  return gNwBackend->Disconnect();
 }
 
 EFI_STATUS GEE_NWFOpen(NW_SHARE_INFO *Share, NW_REMOTE_FILE *File, UINT64 OpenMode,
                        UINT64 Attributes) {
-  return Recorded(SMB2_FOpen(Share, File, OpenMode, Attributes));
+  return Recorded(gNwBackend->Open(Share, File, OpenMode, Attributes));
 }
 
 EFI_STATUS GEE_NWFRead(NW_SHARE_INFO *Share, NW_REMOTE_FILE *File, void *Buffer, UINTN *Length,
@@ -96,31 +89,31 @@ EFI_STATUS GEE_NWFRead(NW_SHARE_INFO *Share, NW_REMOTE_FILE *File, void *Buffer,
     return Recorded(EFI_INVALID_PARAMETER);
   }
   UINTN Count = *Length;
-  EFI_STATUS Status = SMB2_FRead(Share, File, Buffer, &Count, *Offset);
+  EFI_STATUS Status = gNwBackend->Read(Share, File, Buffer, &Count, *Offset);
   *ReadCount = Count;
   return Recorded(Status);
 }
 
 EFI_STATUS GEE_NWFWrite(NW_SHARE_INFO *Share, NW_REMOTE_FILE *File, const void *Buffer,
                         UINTN *Length, UINT64 Offset) {
-  return Recorded(SMB2_FWrite(Share, File, Buffer, Length, Offset));
+  return Recorded(gNwBackend->Write(Share, File, Buffer, Length, Offset));
 }
 
 EFI_STATUS GEE_NWFClose(NW_SHARE_INFO *Share, NW_REMOTE_FILE *File) {
-  return SMB2_FClose(Share, File);
+  return gNwBackend->Close(Share, File);
 }
 
 EFI_STATUS GEE_NWGetFSInfo(NW_SHARE_INFO *Share, EFI_FILE_SYSTEM_INFO *Info) {
-  return Recorded(SMB2_GetFSInfo(Share, Info));
+  return Recorded(gNwBackend->GetFSInfo(Share, Info));
 }
 
 EFI_STATUS GEE_NWFindFirst(NW_SHARE_INFO *Share, const CHAR16 *Pattern, EFI_FILE_INFO **Entry) {
-  return SMB2_FindFirst(Share, Pattern, Entry);
+  return gNwBackend->FindFirst(Share, Pattern, Entry);
 }
 
 EFI_STATUS GEE_NWFindNext(NW_SHARE_INFO *Share, EFI_FILE_INFO **Entry) {
   (void)Share;
-  return Recorded(SMB2_FindNext(Entry));
+  return Recorded(gNwBackend->FindNext(Entry));
 }
 
 // The operations below are acknowledged locally and send nothing to the
@@ -144,7 +137,7 @@ EFI_STATUS GEE_NWRemove(NW_SHARE_INFO *Share, const CHAR16 *Path) {
 }
 
 EFI_STATUS GEE_NWGetFileStat(NW_SHARE_INFO *Share, const CHAR16 *Path, EFI_FILE_INFO *Stat) {
-  return Recorded(SMB2_GetFileStat(Share, Path, Stat));
+  return Recorded(gNwBackend->GetFileStat(Share, Path, Stat));
 }
 
 EFI_STATUS GEE_NWFSetSize(NW_SHARE_INFO *Share, NW_REMOTE_FILE *File, UINT32 Size) {
@@ -199,115 +192,4 @@ BOOLEAN ReleaseNetworkBusyLock(UINT8 *Busy, EFI_EVENT *Event) {
     *Busy = 0;
   }
   return *Busy != 0 ? TRUE : FALSE;
-}
-
-// ---------------------------------------------------------------------------
-// Login names
-// ---------------------------------------------------------------------------
-EFI_STATUS SearchUserAndDomainSeparator(const CHAR8 *Input, CHAR8 Separator, UINTN UserSize,
-                                        CHAR8 *User, UINTN DomainSize, CHAR8 *Domain) {
-  if (Input == nullptr || User == nullptr || Domain == nullptr) {
-    return EFI_INVALID_PARAMETER;
-  }
-  const CHAR8 *Found = AsciiStrChr(Input, Separator);
-  DiagLog(DIAG_VERBOSE, "Ptr to find FindAtSign in Input = %s\n", Found);
-  if (Found == nullptr) {
-    DiagLog(DIAG_VERBOSE, "Ptr is NULL\n");
-    UINTN Length = AsciiStrLen(Input);
-    if (UserSize > Length) {
-      CopyPart(User, Input, Length + 1);
-      ZeroMem(Domain, DomainSize);
-    }
-    return EFI_NOT_FOUND;
-  }
-  UINTN Index = static_cast<UINTN>(Found - Input);
-  DiagLog(DIAG_VERBOSE, "Index = %d\n", static_cast<INT32>(Index));
-  const CHAR8 *After = Found + 1;
-  UINTN AfterLength = AsciiStrLen(After);
-  // With '@' the user comes first, with '\' the domain does.
-  bool UserFirst = Separator != '\\';
-  CHAR8 *BeforeTarget = UserFirst ? User : Domain;
-  CHAR8 *AfterTarget = UserFirst ? Domain : User;
-  UINTN BeforeRoom = UserFirst ? UserSize : DomainSize;
-  UINTN AfterRoom = UserFirst ? DomainSize : UserSize;
-  ZeroMem(User, UserSize);
-  ZeroMem(Domain, DomainSize);
-  // The size tests are tied to the position, deliberately: the part before
-  // the separator is measured against the user size and the part after it
-  // against the domain size, whichever buffer receives it. Neither part is
-  // terminated here (the buffers were cleared). A part is also never copied
-  // past the buffer it lands in.
-  if (Index <= UserSize && Index <= BeforeRoom) {
-    CopyPart(BeforeTarget, Input, Index);
-  }
-  if (DomainSize > AfterLength && AfterLength <= AfterRoom) {
-    CopyPart(AfterTarget, After, AfterLength);
-  }
-  DiagLog(DIAG_VERBOSE, "Domainname = %s\n", Domain);
-  return EFI_SUCCESS;
-}
-
-EFI_STATUS SplitUserAndDomain(const CHAR8 *Input, UINTN UserSize, CHAR8 *User, UINTN DomainSize,
-                              CHAR8 *Domain) {
-  if (Input == nullptr || User == nullptr || Domain == nullptr) {
-    DiagLog(DIAG_ALWAYS, "Input is NULL!\n");
-    return EFI_INVALID_PARAMETER;
-  }
-  EFI_STATUS Status = SearchUserAndDomainSeparator(Input, '@', UserSize, User, DomainSize, Domain);
-  if (!EFI_ERROR(Status)) {
-    return Status;
-  }
-  if (gDriverDebugLevel != 0) {
-    DiagLog(DIAG_ALWAYS, "SearchUserAndDomainSeparator returned error 0x%x for %c\n",
-            static_cast<UINT32>(Status), '@');
-  }
-  Status = SearchUserAndDomainSeparator(Input, '\\', UserSize, User, DomainSize, Domain);
-  if (EFI_ERROR(Status) && gDriverDebugLevel != 0) {
-    DiagLog(DIAG_ALWAYS, "SearchUserAndDomainSeparator returned error 0x%x for %c\n",
-            static_cast<UINT32>(Status), '\\');
-  }
-  return Status;
-}
-
-// ---------------------------------------------------------------------------
-// Helpers of the adapter
-// ---------------------------------------------------------------------------
-void FillDefaultFileTime(UINT32 Ignored, EFI_TIME *Time) {
-  (void)Ignored;
-  if (Time == nullptr) {
-    return;
-  }
-  Time->Year = 2018;
-  Time->Month = 1;
-  Time->Day = 1;
-  Time->Hour = 10;
-  Time->Minute = 10;
-  Time->Second = 10;
-  Time->Nanosecond = 0;
-}
-
-void FreeDirNodeList(SMB2_DIR_NODE **Head) {
-  if (Head == nullptr) {
-    return;
-  }
-  SMB2_DIR_NODE *Node = *Head;
-  while (Node != nullptr) {
-    SMB2_DIR_NODE *Next = Node->Next;
-    FreePool(Node);
-    Node = Next;
-  }
-  *Head = nullptr;
-}
-
-EFI_STATUS DumpDirNodeList(const SMB2_DIR_NODE *Head) {
-  if (Head == nullptr) {
-    DiagLog(DIAG_ALWAYS, "NewNode is NULL!\n");
-    return EFI_INVALID_PARAMETER;
-  }
-  // The last node is deliberately not printed.
-  for (const SMB2_DIR_NODE *Node = Head; Node->Next != nullptr; Node = Node->Next) {
-    DiagLog(DIAG_VERBOSE, "File Size = %ld, Filename = %ls\n", static_cast<INT64>(Node->EndOfFile),
-            reinterpret_cast<const CHAR16 *>(Node->FileName));
-  }
-  return EFI_SUCCESS;
 }

@@ -1,63 +1,19 @@
 // The network library: the GEE_NW... operations through which the volume
-// and the mount code reach the share, the records they exchange (share
-// record, connection parameters, remote file record), the status record in
-// "PROVISIONING_ENV_VOLATILE_VAR", the network busy lock, the login
-// splitter, the fixed file time and the directory-node list helpers.
+// and the mount code reach the share, the status record in
+// "PROVISIONING_ENV_VOLATILE_VAR" and the network busy lock. The records the operations exchange
+// (share record, connection parameters, remote file record) are the back end's (NwBackend.h).
 //
-// Every operation forwards to the SMB2 file-system adapter whatever the
-// share type: CIFS (1) and NFS (2) both reach the same SMB2 code; there is
-// deliberately no second back end. Directory creation, removal, the end of a
-// listing, size changes and commits are acknowledged locally and send
-// nothing.
+// Every operation forwards to one back end through its table, whatever the
+// share type: CIFS (1) and NFS (2) both reach the SMB2 file-system adapter;
+// there is deliberately no second back end. Directory creation, removal, the
+// end of a listing, size changes and commits are acknowledged locally and
+// send nothing.
 #pragma once
 
+#include "NwBackend.h"
 #include "Uefi.h"
 
-struct SMB2_DIR_NODE;
-
-constexpr UINT64 NW_SHARE_TYPE_CIFS = 1;
-constexpr UINT64 NW_SHARE_TYPE_NFS = 2;
-
-// The share record's current file path (8-bit, from the share's root).
-constexpr UINTN NW_SHARE_FILE_PATH_FIELD = 336;
-constexpr UINTN NW_SHARE_RECORD_SIZE = 632;
-
 #pragma pack(push, 1)
-// The share record: built by the mount, owned by the volume, first argument
-// of every per-share operation. Everything after the keep-alive event
-// belongs to the adapter.
-struct NW_SHARE_INFO {
-  CHAR16 *sharename; // as given on the command line
-  void *Reserved;
-  UINT64 shareType; // NW_SHARE_TYPE_CIFS or NW_SHARE_TYPE_NFS
-  void *Reserved2;
-  EFI_EVENT KeepAliveEvent;
-  // Adapter area: the directory a listing is taken of, and room kept free.
-  CHAR8 FilePath[NW_SHARE_FILE_PATH_FIELD];
-  UINT8 AdapterReserved[NW_SHARE_RECORD_SIZE - 40 - NW_SHARE_FILE_PATH_FIELD];
-};
-
-// The connection parameters handed to GEE_NWFSConnect (and kept by the
-// volume as its ConnectionInfo).
-struct NW_CONNECTION_PARAMS {
-  CHAR16 *ipAddress;
-  CHAR16 *username; // CIFS; may carry a domain: "user@domain" or "domain\user"
-  CHAR16 *password; // CIFS
-  UINT32 uid;       // NFS: the user argument as a number
-  UINT32 gid;       // NFS: the password argument as a number
-};
-
-// The remote file record each file handle embeds: what the adapter needs to
-// open, read, write and close one file.
-struct NW_REMOTE_FILE {
-  UINT16 Reserved;
-  UINT8 OplockLevel; // SMB2 oplock level asked for at open
-  UINT8 Reserved2;
-  UINT8 FileId[16]; // filled by GEE_NWFOpen, zeroed by GEE_NWFClose
-  UINT32 Reserved3;
-  CHAR16 *FileName; // from the share's root
-};
-
 // The outcome record in "PROVISIONING_ENV_VOLATILE_VAR": the status of the
 // last recorded network operation, then 32 bytes that are kept as read.
 struct NW_OPERATION_STATUS_RECORD {
@@ -74,23 +30,13 @@ struct NETWORK_BUSY_LOCK {
   EFI_EVENT Event;
 };
 
-static_assert(sizeof(NW_SHARE_INFO) == NW_SHARE_RECORD_SIZE, "share record is 632 bytes");
-static_assert(offsetof(NW_SHARE_INFO, Reserved) == 8, "share record: reserved pointer");
-static_assert(offsetof(NW_SHARE_INFO, shareType) == 16, "share record: share type");
-static_assert(offsetof(NW_SHARE_INFO, Reserved2) == 24, "share record: second pointer");
-static_assert(offsetof(NW_SHARE_INFO, KeepAliveEvent) == 32, "share record: keep-alive event");
-static_assert(offsetof(NW_SHARE_INFO, FilePath) == 40, "share record: adapter area");
-static_assert(sizeof(NW_CONNECTION_PARAMS) == 32, "connection parameters are 32 bytes");
-static_assert(offsetof(NW_CONNECTION_PARAMS, uid) == 24, "connection parameters: uid");
-static_assert(offsetof(NW_CONNECTION_PARAMS, gid) == 28, "connection parameters: gid");
-static_assert(offsetof(NW_REMOTE_FILE, OplockLevel) == 2, "remote file: oplock byte");
-static_assert(offsetof(NW_REMOTE_FILE, FileId) == 4, "remote file: file id");
-static_assert(offsetof(NW_REMOTE_FILE, FileName) == 24, "remote file: name pointer");
-static_assert(sizeof(NW_REMOTE_FILE) == 32, "remote file record size");
 static_assert(sizeof(NW_OPERATION_STATUS_RECORD) == 40, "status record is 40 bytes");
 static_assert(offsetof(NETWORK_BUSY_LOCK, Event) == 8, "busy lock: flag, then event");
 
 extern NETWORK_BUSY_LOCK NetworkBusyLock;
+// The back end every operation forwards to: the SMB2 file-system adapter's
+// table (a test may put a scripted one in its place).
+extern const NW_BACKEND *gNwBackend;
 
 // ---------------------------------------------------------------------------
 // Operations (in calling order: init, connect, file operations, disconnect,
@@ -145,25 +91,3 @@ EFI_STATUS SetOperationStatus(EFI_STATUS Status);
 BOOLEAN AcquireNetworkBusyLock(UINT8 *Busy, EFI_EVENT *Event, BOOLEAN Wait);
 // Signals and closes the event and frees the lock; returns the flag (false).
 BOOLEAN ReleaseNetworkBusyLock(UINT8 *Busy, EFI_EVENT *Event);
-
-// ---------------------------------------------------------------------------
-// Login names
-// ---------------------------------------------------------------------------
-// Splits Input at the first Separator: with '@' user before, domain after;
-// with '\' domain before, user after. EFI_NOT_FOUND without the separator
-// (the whole input becomes the user when it fits).
-EFI_STATUS SearchUserAndDomainSeparator(const CHAR8 *Input, CHAR8 Separator, UINTN UserSize,
-                                        CHAR8 *User, UINTN DomainSize, CHAR8 *Domain);
-// Tries '@', then '\'.
-EFI_STATUS SplitUserAndDomain(const CHAR8 *Input, UINTN UserSize, CHAR8 *User, UINTN DomainSize,
-                              CHAR8 *Domain);
-
-// ---------------------------------------------------------------------------
-// Shared helpers of the adapter
-// ---------------------------------------------------------------------------
-// Every remote time is reported as 2018-01-01 10:10:10; the first argument
-// is ignored, time zone and daylight are left as they are.
-void FillDefaultFileTime(UINT32 Ignored, EFI_TIME *Time);
-// Frees every node of the list and clears *Head.
-void FreeDirNodeList(SMB2_DIR_NODE **Head);
-EFI_STATUS DumpDirNodeList(const SMB2_DIR_NODE *Head);
