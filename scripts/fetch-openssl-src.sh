@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
 # Fetches Debian 12's OpenSSL source package and prepares the few headers the
-# firmware image needs from it (MD4, MD5 and RC4 are compiled from these
-# sources into the image; nothing prebuilt is ever linked).
+# firmware image needs from it (MD4, MD5, SHA-256 and RC4 are compiled from
+# these sources into the image; nothing prebuilt is ever linked).
 #
 #   scripts/fetch-openssl-src.sh [DEST]      (default: build/openssl-src)
 #   scripts/fetch-openssl-src.sh --derive-sources SOURCE_LIST SOURCE_PARTS OUT_DIR

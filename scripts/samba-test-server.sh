@@ -20,6 +20,11 @@
 #   SMB_SHARE       share name                   (cifsshare)
 #   SMB_DIR         shared directory             ($SMB_STATE_DIR/share)
 #   SMB_WORKGROUP   workgroup                    (CIFSTEST)
+#   SMB_SIGNING     server signing: mandatory, auto or disabled (unset or
+#                   empty: no such line, Samba's default). "mandatory" makes
+#                   the server refuse unsigned SMB2 requests after the session
+#                   setup; for SMB2, Samba treats "disabled" as "auto" (the
+#                   client may sign, nothing requires it).
 set -euo pipefail
 
 STATE_DIR=${SMB_STATE_DIR:-/tmp/cifsdrv-samba}
@@ -30,6 +35,7 @@ SMB_PASS=${SMB_PASS:-Cifs-Test-Pw1}
 SMB_SHARE=${SMB_SHARE:-cifsshare}
 SMB_DIR=${SMB_DIR:-$STATE_DIR/share}
 WORKGROUP=${SMB_WORKGROUP:-CIFSTEST}
+SIGNING=${SMB_SIGNING:-}
 
 CONF=$STATE_DIR/smb.conf
 PID_DIR=$STATE_DIR/pid
@@ -47,6 +53,8 @@ need_tools() {
   fi
 }
 
+# The configuration file. "server signing" appears only when SMB_SIGNING is
+# set, so that without it the file is Samba's default as before.
 render_conf() {
   cat <<EOF
 [global]
@@ -59,7 +67,8 @@ render_conf() {
   disable netbios = yes
   smb ports = 445
   server min protocol = $MIN_PROTO
-  server max protocol = $MAX_PROTO
+  server max protocol = $MAX_PROTO${SIGNING:+
+  server signing = $SIGNING}
   passdb backend = tdbsam
   private dir = $STATE_DIR/private
   lock directory = $STATE_DIR/lock
@@ -147,6 +156,13 @@ ensure_user() {
 }
 
 do_start() {
+  case "$SIGNING" in
+  "" | mandatory | auto | disabled) ;;
+  *)
+    log "SMB_SIGNING must be mandatory, auto, disabled or empty, not '$SIGNING'"
+    exit 2
+    ;;
+  esac
   need_tools
   mkdir -p "$STATE_DIR"/{private,lock,state,cache,pid,ncalrpc,log}
   chmod 700 "$STATE_DIR/private"

@@ -1,8 +1,8 @@
 # The firmware image ${CMAKE_BINARY_DIR}/CIFSDrv.efi: every application source
-# and the UEFI platform sources (with OpenSSL's MD4, MD5 and RC4 sources),
-# compiled freestanding for the Microsoft x64 ABI, linked by lld-link as an
-# EFI application with the entry EfiMain. Beside it, the firmware test images
-# of tests/firmware.
+# and the UEFI platform sources (with OpenSSL's MD4, MD5, SHA-256 and RC4
+# sources), compiled freestanding for the Microsoft x64 ABI, linked by
+# lld-link as an EFI application with the entry EfiMain. Beside it, the
+# firmware test images of tests/firmware.
 #
 # Included by the top-level CMakeLists.txt when CIFSDRV_PLATFORM is Uefi; the
 # toolchain is cmake/UefiToolchain.cmake.
@@ -38,8 +38,8 @@ endif()
 set_source_files_properties(${UEFI_PLATFORM_DIR}/UefiTcp.cpp PROPERTIES COMPILE_OPTIONS
   "-isystem;${UEFI_GNU_EFI_INCLUDE_DIR};-isystem;${UEFI_GNU_EFI_INCLUDE_DIR}/x86_64")
 
-# OpenSSL's MD4, MD5 and RC4, compiled from Debian's source package with the
-# image's code generation (never from a prebuilt library). The fetch script
+# OpenSSL's MD4, MD5, SHA-256 and RC4, compiled from Debian's source package
+# with the image's code generation (never from a prebuilt library). The fetch script
 # returns at once when the pinned sources are already prepared.
 set(CIFSDRV_OPENSSL_SRC "${CMAKE_SOURCE_DIR}/build/openssl-src" CACHE PATH
     "Where scripts/fetch-openssl-src.sh keeps the OpenSSL sources for the image")
@@ -86,6 +86,7 @@ set(UEFI_IMAGE_OBJECTS $<TARGET_OBJECTS:cifsdrv_image_objects> ${UEFI_SUPPORT_OB
 set(UEFI_C_SOURCES
     ${UEFI_OPENSSL_DIR}/crypto/md4/md4_dgst.c
     ${UEFI_OPENSSL_DIR}/crypto/md5/md5_dgst.c
+    ${UEFI_OPENSSL_DIR}/crypto/sha/sha256.c
     ${UEFI_OPENSSL_DIR}/crypto/rc4/rc4_skey.c
     ${UEFI_OPENSSL_DIR}/crypto/rc4/rc4_enc.c)
 set(UEFI_C_INCLUDE_DIRS ${UEFI_OPENSSL_SHIM_DIR} ${UEFI_OPENSSL_DIR}/include)

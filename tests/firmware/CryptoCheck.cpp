@@ -1,10 +1,11 @@
 // Firmware self-test of the image's crypto and random bytes, run inside
 // OVMF by run-crypto-test.sh. It links the platform code exactly as
 // CIFSDrv.efi does and checks every primitive against published vectors:
-// MD4 (RFC 1320), MD5 (RFC 1321), HMAC-MD5 (RFC 2202) and RC4, each also fed
-// in uneven pieces and at length, since the digest code has been seen to go
-// wrong only under firmware interrupts. Then it reports which random source
-// answered ("@@RANDOM <source>"); the script knows which one QEMU offers.
+// MD4 (RFC 1320), MD5 (RFC 1321), HMAC-MD5 (RFC 2202), HMAC-SHA256
+// (RFC 4231) and RC4, each also fed in uneven pieces and at length, since the
+// digest code has been seen to go wrong only under firmware interrupts. Then
+// it reports which random source answered ("@@RANDOM <source>"); the script
+// knows which one QEMU offers.
 #include "FirmwareTestConsole.h"
 #include "NwPlatform.h"
 #include "UefiCrypto.h"
@@ -37,6 +38,9 @@ constexpr DigestVector kDigestVectors[] = {
 constexpr UINT64 kMillion = 1000000;
 constexpr const char *kMillionAMd4 = "bbce80cc6bb65e5c6745e30d4eeca9a4";
 constexpr const char *kMillionAMd5 = "7707d6ae4e027c70eea2a935c2296f21";
+// HMAC-SHA256 of the same message under the key "Jefe".
+constexpr const char *kMillionAHmacSha256 =
+    "abce68067d665c96b6f4491fdc3de999dc09731b2d50a1f5e758d9ed583319d6";
 
 struct HmacVector {
   UINT8 KeyByte; // the key is KeyLength copies of KeyByte, or 1..KeyLength when 0
@@ -45,11 +49,13 @@ struct HmacVector {
   UINT8 DataByte;      // the data is DataLength copies of DataByte
   UINT8 DataLength;
   const char *DataText; // instead of the bytes, when set
-  const char *Mac;
+  const char *Mac;      // all of it
 };
+constexpr UINTN kMaxHmacKey = 131;
+constexpr UINTN kMaxHmacData = 50;
 
 // RFC 2202, test cases 1 to 7 for HMAC-MD5.
-constexpr HmacVector kHmacVectors[] = {
+constexpr HmacVector kHmacMd5Vectors[] = {
     {0x0b, 16, nullptr, 0, 0, "Hi There", "9294727a3638bb1c13f48ef8158bfc9d"},
     {0, 0, "Jefe", 0, 0, "what do ya want for nothing?", "750c783e6ab0b503eaa86e310a5db738"},
     {0xaa, 16, nullptr, 0xdd, 50, nullptr, "56be34521d144c88dbb8c733f0e8b3f6"},
@@ -60,6 +66,27 @@ constexpr HmacVector kHmacVectors[] = {
     {0xaa, 80, nullptr, 0, 0,
      "Test Using Larger Than Block-Size Key and Larger Than One Block-Size Data",
      "6f630fad67cda0ee1fb1f562db3aa53e"},
+};
+
+// RFC 4231, test cases 1 to 7 for HMAC-SHA-256. The RFC prints only the first
+// 16 bytes of case 5; its MAC here is whole.
+constexpr HmacVector kHmacSha256Vectors[] = {
+    {0x0b, 20, nullptr, 0, 0, "Hi There",
+     "b0344c61d8db38535ca8afceaf0bf12b881dc200c9833da726e9376c2e32cff7"},
+    {0, 0, "Jefe", 0, 0, "what do ya want for nothing?",
+     "5bdcc146bf60754e6a042426089575c75a003f089d2739839dec58b964ec3843"},
+    {0xaa, 20, nullptr, 0xdd, 50, nullptr,
+     "773ea91e36800e46854db8ebd09181a72959098b3ef8c122d9635514ced565fe"},
+    {0, 25, nullptr, 0xcd, 50, nullptr,
+     "82558a389a443c0ea4cc819899f2083a85f0faa3e578f8077a2e3ff46729665b"},
+    {0x0c, 20, nullptr, 0, 0, "Test With Truncation",
+     "a3b6167473100ee06e0c796c2955552bfa6f7c0a6a8aef8b93f860aab0cd20c5"},
+    {0xaa, 131, nullptr, 0, 0, "Test Using Larger Than Block-Size Key - Hash Key First",
+     "60e431591ee0b67f0d8a26aacbf5b77f8e0bc6213728c5140546040f0ee37f54"},
+    {0xaa, 131, nullptr, 0, 0,
+     "This is a test using a larger than block-size key and a larger than block-size data. "
+     "The key needs to be hashed before being used by the HMAC algorithm.",
+     "9b09ffa71b942fcb27635fbcd5b0e944bfdc63644f0713938a7f51535c3a35e2"},
 };
 
 struct Rc4Vector {
@@ -131,17 +158,21 @@ void CheckMillion() {
   }
   SetMem(A, kChunk, 'a');
   NwMd4Context Md4;
-  bool Ok = NwMd4Init(&Md4);
+  NwHmacSha256Context Hmac;
+  bool Ok = NwMd4Init(&Md4) && NwHmacSha256Init(&Hmac, Bytes("Jefe"), 4);
   UINT64 Done = 0;
   for (UINT64 Piece = 1; Ok && Done < kMillion; Piece = (Piece * 5 + 13) % kChunk + 1) {
     UINT64 Take = kMillion - Done < Piece ? kMillion - Done : Piece;
-    Ok = NwMd4Update(&Md4, A, Take);
+    Ok = NwMd4Update(&Md4, A, Take) && NwHmacSha256Update(&Hmac, A, Take);
     Done += Take;
   }
   UINT8 Digest[16] = {};
-  Ok = Ok && NwMd4Final(&Md4, Digest);
+  UINT8 Mac[NW_SHA256_DIGEST_SIZE] = {};
+  Ok = Ok && NwMd4Final(&Md4, Digest) && NwHmacSha256Final(&Hmac, Mac);
   FwTestCheck(Ok && HexIs(Digest, 16, kMillionAMd4), "MD4 of a million 'a' = %a",
               FwTestHex(Digest, 16));
+  FwTestCheck(Ok && HexIs(Mac, sizeof(Mac), kMillionAHmacSha256),
+              "HMAC-SHA256 of a million 'a' = %a", FwTestHex(Mac, sizeof(Mac)));
   // MD5 over the same message in one piece.
   UINT8 *Big = static_cast<UINT8 *>(AllocatePool(kMillion));
   if (Big != nullptr) {
@@ -156,11 +187,25 @@ void CheckMillion() {
   FreePool(A);
 }
 
-void CheckHmacVectors() {
-  UINT32 Case = 1;
-  for (const HmacVector &V : kHmacVectors) {
-    UINT8 Key[80];
-    UINT8 Data[50];
+// The MAC of Data under Key through one of the facade's HMACs, fed as the
+// first Split bytes and then the rest.
+template <typename Context, bool (*Init)(Context *, const uint8_t *, uint64_t),
+          bool (*Update)(Context *, const void *, uint64_t), bool (*Final)(Context *, uint8_t *)>
+bool HmacInTwo(const UINT8 *Key, UINTN KeyLength, const UINT8 *Data, UINTN DataLength, UINTN Split,
+               UINT8 *Mac) {
+  Context Ctx;
+  return Init(&Ctx, Key, KeyLength) && Update(&Ctx, Data, Split) &&
+         Update(&Ctx, Data + Split, DataLength - Split) && Final(&Ctx, Mac);
+}
+using HmacFunction = bool (*)(const UINT8 *, UINTN, const UINT8 *, UINTN, UINTN, UINT8 *);
+
+template <UINTN Count>
+void CheckHmacVectors(const char *Name, const HmacVector (&Vectors)[Count], HmacFunction Hmac,
+                      UINTN MacLength) {
+  for (UINT32 Case = 1; Case <= Count; Case++) {
+    const HmacVector &V = Vectors[Case - 1];
+    UINT8 Key[kMaxHmacKey];
+    UINT8 Data[kMaxHmacData];
     const UINT8 *KeyBytes = Key;
     UINTN KeyLength = V.KeyLength;
     if (V.KeyText != nullptr) {
@@ -180,18 +225,24 @@ void CheckHmacVectors() {
       SetMem(Data, DataLength, V.DataByte);
     }
     // Whole, then in two uneven updates.
-    NwHmacMd5Context Ctx;
-    UINT8 Mac[16] = {};
-    bool Ok = NwHmacMd5Init(&Ctx, KeyBytes, KeyLength) &&
-              NwHmacMd5Update(&Ctx, DataBytes, DataLength) && NwHmacMd5Final(&Ctx, Mac);
-    FwTestCheck(Ok && HexIs(Mac, 16, V.Mac), "HMAC-MD5 RFC 2202 case %u = %a", Case,
-                FwTestHex(Mac, 16));
-    UINT8 Split[16] = {};
-    Ok = NwHmacMd5Init(&Ctx, KeyBytes, KeyLength) && NwHmacMd5Update(&Ctx, DataBytes, 3) &&
-         NwHmacMd5Update(&Ctx, DataBytes + 3, DataLength - 3) && NwHmacMd5Final(&Ctx, Split);
-    FwTestCheck(Ok && HexIs(Split, 16, V.Mac), "HMAC-MD5 RFC 2202 case %u in two updates", Case);
-    Case++;
+    UINT8 Mac[NW_SHA256_DIGEST_SIZE] = {};
+    bool Ok = Hmac(KeyBytes, KeyLength, DataBytes, DataLength, DataLength, Mac);
+    FwTestCheck(Ok && HexIs(Mac, MacLength, V.Mac), "%a case %u = %a", Name, Case,
+                FwTestHex(Mac, MacLength));
+    UINT8 Split[NW_SHA256_DIGEST_SIZE] = {};
+    Ok = Hmac(KeyBytes, KeyLength, DataBytes, DataLength, 3, Split);
+    FwTestCheck(Ok && HexIs(Split, MacLength, V.Mac), "%a case %u in two updates", Name, Case);
   }
+}
+
+void CheckHmacs() {
+  CheckHmacVectors("HMAC-MD5 RFC 2202", kHmacMd5Vectors,
+                   HmacInTwo<NwHmacMd5Context, NwHmacMd5Init, NwHmacMd5Update, NwHmacMd5Final>,
+                   NW_MD5_DIGEST_SIZE);
+  CheckHmacVectors(
+      "HMAC-SHA256 RFC 4231", kHmacSha256Vectors,
+      HmacInTwo<NwHmacSha256Context, NwHmacSha256Init, NwHmacSha256Update, NwHmacSha256Final>,
+      NW_SHA256_DIGEST_SIZE);
 }
 
 void CheckRc4() {
@@ -232,6 +283,11 @@ void CheckRefusals() {
   NwHmacMd5Context Hmac;
   FwTestCheck(!NwHmacMd5Init(&Hmac, nullptr, 16) && !NwHmacMd5Init(nullptr, Key, 16),
               "HMAC-MD5 refuses a missing key or context");
+  NwHmacSha256Context Sha;
+  FwTestCheck(!NwHmacSha256Init(&Sha, nullptr, 16) && !NwHmacSha256Init(nullptr, Key, 16) &&
+                  NwHmacSha256Init(&Sha, Key, 16) && !NwHmacSha256Update(&Sha, nullptr, 1) &&
+                  !NwHmacSha256Final(&Sha, nullptr),
+              "HMAC-SHA256 refuses a missing key, context, data or digest");
   UINT8 Digest[16];
   FwTestCheck(!UefiMd5Digest(nullptr, 1, Digest), "MD5 refuses missing data");
 }
@@ -274,7 +330,7 @@ extern "C" EFI_STATUS EFIAPI EfiMain(EFI_HANDLE ImageHandle, EFI_SYSTEM_TABLE *S
   FwTestPrint("@@BEGIN crypto-check\n");
   CheckDigestVectors();
   CheckMillion();
-  CheckHmacVectors();
+  CheckHmacs();
   CheckRc4();
   CheckRefusals();
   CheckRandom();

@@ -2,8 +2,8 @@
 # Runs the crypto self-test image CryptoCheck.efi in QEMU/OVMF, three times:
 # with a virtio RNG (random bytes from EFI_RNG_PROTOCOL), without it on a
 # processor with RDRAND (-cpu max), and with neither (random bytes must then
-# fail). Each run checks MD4, MD5, HMAC-MD5 and RC4 against their published
-# vectors inside the firmware.
+# fail). Each run checks MD4, MD5, HMAC-MD5, HMAC-SHA256 and RC4 against
+# their published vectors inside the firmware.
 #
 #   tests/firmware/run-crypto-test.sh BUILD_DIR   (the directory holding CryptoCheck.efi)
 #

@@ -85,14 +85,21 @@ uint32_t NwOpenSocketCount();
 int32_t NwGetTimeOfDay(NwTimeVal *Tv);
 
 // Cryptographic primitives. Contexts are opaque blocks that the caller
-// provides; each Init/Update/Final returns true on success.
+// provides; each Init/Update/Final returns true on success. Final (and a
+// failed Init) clears the context, so no key material stays behind in it.
+// Updates may be split anywhere: a message in several buffers is fed piece
+// by piece.
 constexpr uint32_t NW_MD4_DIGEST_SIZE = 16;
 constexpr uint32_t NW_MD5_DIGEST_SIZE = 16;
+constexpr uint32_t NW_SHA256_DIGEST_SIZE = 32;
 
 struct alignas(8) NwMd4Context {
   uint8_t Opaque[160];
 };
 struct alignas(8) NwHmacMd5Context {
+  uint8_t Opaque[512];
+};
+struct alignas(8) NwHmacSha256Context {
   uint8_t Opaque[512];
 };
 struct alignas(8) NwArc4Context {
@@ -106,6 +113,10 @@ bool NwMd4Final(NwMd4Context *Ctx, uint8_t Digest[NW_MD4_DIGEST_SIZE]);
 bool NwHmacMd5Init(NwHmacMd5Context *Ctx, const uint8_t *Key, uint64_t KeyLength);
 bool NwHmacMd5Update(NwHmacMd5Context *Ctx, const void *Data, uint64_t Length);
 bool NwHmacMd5Final(NwHmacMd5Context *Ctx, uint8_t Digest[NW_MD5_DIGEST_SIZE]);
+
+bool NwHmacSha256Init(NwHmacSha256Context *Ctx, const uint8_t *Key, uint64_t KeyLength);
+bool NwHmacSha256Update(NwHmacSha256Context *Ctx, const void *Data, uint64_t Length);
+bool NwHmacSha256Final(NwHmacSha256Context *Ctx, uint8_t Digest[NW_SHA256_DIGEST_SIZE]);
 
 bool NwArc4Init(NwArc4Context *Ctx, const uint8_t *Key, uint64_t KeyLength);
 bool NwArc4Encrypt(NwArc4Context *Ctx, const uint8_t *Input, uint64_t Length, uint8_t *Output);
