@@ -96,9 +96,6 @@ CHAR8 *UnicodeStrDupToAscii(const CHAR16 *Source); // pool, length + 1 character
 UINTN AsciiVSPrint(CHAR8 *Buffer, UINTN BufferSize, const CHAR8 *Format, va_list Args);
 UINTN AsciiSPrint(CHAR8 *Buffer, UINTN BufferSize, const CHAR8 *Format, ...);
 // UCS-2 output from an 8-bit format.
-UINTN UnicodeVSPrintAsciiFormat(CHAR16 *Buffer, UINTN BufferChars, const CHAR8 *Format,
-                                va_list Args);
 UINTN UnicodeSPrintAsciiFormat(CHAR16 *Buffer, UINTN BufferChars, const CHAR8 *Format, ...);
 // UCS-2 output from a UCS-2 format.
-UINTN UnicodeVSPrint(CHAR16 *Buffer, UINTN BufferChars, const CHAR16 *Format, va_list Args);
 UINTN UnicodeSPrint(CHAR16 *Buffer, UINTN BufferChars, const CHAR16 *Format, ...);
