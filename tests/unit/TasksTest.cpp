@@ -107,9 +107,9 @@ TEST_F(TasksTest, ShareIsMappedUnderItsIdentifierOnlyWhenItsNameDiffers) {
   // A partition-table label gets the shell name of its row ("catalog" for
   // "CATLOG"), which differs from the identifier; a quote in the identifier
   // makes the shell refuse to launch the map command line.
-  const SHARE_MAPPING_STYLE Strict = {.NoDriveText = "no drive%ls\n",
+  const SHARE_MAPPING_STYLE Strict = {.NoDriveText = "none%ls\n",
                                       .NoDriveStatus = EFI_NOT_FOUND,
-                                      .FailureText = u"failed: %s\n",
+                                      .FailureText = u"failed %s\n",
                                       .FailureStatusLine = true};
   const SHARE_MAPPING_STYLE Lenient = {.FailureEnds = false};
   struct Case {
@@ -120,23 +120,15 @@ TEST_F(TasksTest, ShareIsMappedUnderItsIdentifierOnlyWhenItsNameDiffers) {
     const char *DriveName;
     std::vector<std::string> Lines; // in this order after the lookup's; none: nothing
   };
-  const std::string Map = "trying to map --> command: map CATLOG\" catalog:\n";
+  const EFI_STATUS NotLaunched = static_cast<EFI_STATUS>(-1);
+  const std::string Map = "trying to map --> command: map CATLOG";
+  const std::string Quoted = Map + "\" catalog:\n";
   const Case Cases[] = {
       {u"CIFS", Strict, true, EFI_SUCCESS, "CIFS", {}},
-      {u"CATLOG",
-       Strict,
-       true,
-       EFI_SUCCESS,
-       "catalog",
-       {"trying to map --> command: map CATLOG catalog:\n"}},
-      {u"CATLOG\"",
-       Strict,
-       false,
-       static_cast<EFI_STATUS>(-1),
-       "catalog",
-       {Map, "failed: map CATLOG\" catalog:\n\n (", ")Status = [-1]\n"}},
-      {u"CATLOG\"", Lenient, true, EFI_SUCCESS, "catalog", {Map}},
-      {nullptr, Strict, false, EFI_NOT_FOUND, "", {"no drive\n"}},
+      {u"CATLOG", Strict, true, EFI_SUCCESS, "catalog", {Map + " catalog:\n"}},
+      {u"CATLOG\"", Strict, false, NotLaunched, "catalog", {Quoted, "failed map", "Status = [-1]"}},
+      {u"CATLOG\"", Lenient, true, EFI_SUCCESS, "catalog", {Quoted}},
+      {nullptr, Strict, false, EFI_NOT_FOUND, "", {"none\n"}},
       {nullptr, Lenient, true, EFI_SUCCESS, "", {}},
   };
   for (const Case &C : Cases) {
