@@ -537,9 +537,3 @@ void HostVariablesClose() {
 void HostVariablesReload() {
   LoadStore();
 }
-
-void HostVariablesFlush() {
-  if (!WriteStore()) {
-    fprintf(stderr, "host: cannot write the variable store %s\n", gStorePath.c_str());
-  }
-}

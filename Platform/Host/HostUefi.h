@@ -39,9 +39,8 @@ uint64_t HostPoolOutstandingBytes();
 // call, never from a signal handler).
 void HostDispatchTimers();
 
-// Variable store: reload from / flush to the file named in HostConfig.
+// Variable store: reload from the file named in HostConfig.
 void HostVariablesReload();
-void HostVariablesFlush();
 
 // Fake IPMI transport in the configuration table under
 // {4F6B6541-ADD6-4B0F-A503-D78ABDA0851E}. With Enabled false the table entry

@@ -125,14 +125,12 @@ TEST_F(BaseLibTest, ComparisonsAndSearches) {
   EXPECT_EQ(StrnCmp(u"NFS1", u"NFS2", 3), 0);
 
   const char *Haystack = "aaab:\\catalog";
-  EXPECT_EQ(AsciiStrStr(Haystack, "aab"), Haystack + 1); // after a false start
-  EXPECT_EQ(AsciiStrStr(Haystack, "catalogs"), nullptr);
-  EXPECT_EQ(AsciiStrStr(Haystack, ""), Haystack);
   EXPECT_EQ(AsciiStrChr(Haystack, ':'), Haystack + 4);
   EXPECT_EQ(AsciiStrChr(Haystack, '\0'), Haystack + 13);
-  const char16_t *Wide = u"map -u fs0:";
-  EXPECT_EQ(StrStr(Wide, u"fs0"), Wide + 7);
-  EXPECT_EQ(StrStr(Wide, u"fs1"), nullptr);
+  const char16_t *Wide = u"aaab:\\catalog";
+  EXPECT_EQ(StrStr(Wide, u"aab"), Wide + 1); // after a false start
+  EXPECT_EQ(StrStr(Wide, u"catalogs"), nullptr);
+  EXPECT_EQ(StrStr(Wide, u""), Wide);
 }
 
 TEST_F(BaseLibTest, DecimalParse) {
@@ -156,19 +154,16 @@ TEST_F(BaseLibTest, DecimalParse) {
 }
 
 TEST_F(BaseLibTest, Conversions) {
-  char16_t Wide[8];
-  AsciiStrToUnicodeS("caf\xe9 au lait", Wide, 8);
-  EXPECT_EQ(std::u16string(Wide), u"caf\u00e9 au");
   char Narrow[8];
   UnicodeStrToAsciiS(u"\u20ac5 \u00e9t\u00e9!", Narrow, 6);
   EXPECT_STREQ(Narrow, "?5 \xe9t");
 
-  char16_t *Dup = AsciiStrDupToUnicode("ramfs:\\catalog.xml");
+  char16_t *Dup = AsciiStrDupToUnicode("ramfs:\\caf\xe9.xml");
   char *Back = UnicodeStrDupToAscii(Dup);
   char16_t *Copy = StrDup(Dup);
   ASSERT_TRUE(Dup != nullptr && Back != nullptr && Copy != nullptr);
-  EXPECT_EQ(std::u16string(Dup), u"ramfs:\\catalog.xml");
-  EXPECT_STREQ(Back, "ramfs:\\catalog.xml");
+  EXPECT_EQ(std::u16string(Dup), u"ramfs:\\caf\u00e9.xml"); // Latin-1, not sign-extended
+  EXPECT_STREQ(Back, "ramfs:\\caf\xe9.xml");
   EXPECT_EQ(std::u16string(Copy), std::u16string(Dup));
   FreePool(Dup);
   FreePool(Back);

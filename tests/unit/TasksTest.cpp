@@ -104,19 +104,59 @@ TEST_F(TasksTest, LongDirectoryIsCopiedButNotPersisted) {
 }
 
 TEST_F(TasksTest, ShareIsMappedUnderItsIdentifierOnlyWhenItsNameDiffers) {
-  EXPECT_FALSE(DriveNeedsIdentifierMapping(u"", u"CIFS"));
-  EXPECT_FALSE(DriveNeedsIdentifierMapping(u"CIFS", u"CIFS"));
-  EXPECT_FALSE(DriveNeedsIdentifierMapping(u"CIFS2", u"CIFS"));
-  EXPECT_TRUE(DriveNeedsIdentifierMapping(u"CIF", u"CIFS"));
-  EXPECT_TRUE(DriveNeedsIdentifierMapping(u"fs1", u"CIFS"));
-  EXPECT_TRUE(DriveNeedsIdentifierMapping(u"CIFS", u"NFS"));
-  CHAR16 *Command = nullptr;
-  std::string Out = Console([&] { Command = BuildMapCommand(u"CIFS", u"FS1"); });
-  ASSERT_NE(Command, nullptr);
-  EXPECT_EQ(HostUcs2ToUtf8(Command), "map CIFS FS1:");
-  EXPECT_EQ(Out, "trying to map --> command: map CIFS FS1:\n");
-  FreePool(Command);
-  ExpectNoPoolLeak();
+  // A partition-table label gets the shell name of its row ("catalog" for
+  // "CATLOG"), which differs from the identifier; a quote in the identifier
+  // makes the shell refuse to launch the map command line.
+  const SHARE_MAPPING_STYLE Strict = {.NoDriveText = "none%ls\n",
+                                      .NoDriveStatus = EFI_NOT_FOUND,
+                                      .FailureText = u"failed %s\n",
+                                      .FailureStatusLine = true};
+  const SHARE_MAPPING_STYLE Lenient = {.FailureEnds = false};
+  struct Case {
+    const CHAR16 *Label; // of the share and the identifier; null: no share
+    const SHARE_MAPPING_STYLE &Style;
+    bool GoesOn;
+    EFI_STATUS Status;
+    const char *DriveName;
+    std::vector<std::string> Lines; // in this order after the lookup's; none: nothing
+  };
+  const EFI_STATUS NotLaunched = static_cast<EFI_STATUS>(-1);
+  const std::string Map = "trying to map --> command: map CATLOG";
+  const std::string Quoted = Map + "\" catalog:\n";
+  const Case Cases[] = {
+      {u"CIFS", Strict, true, EFI_SUCCESS, "CIFS", {}},
+      {u"CATLOG", Strict, true, EFI_SUCCESS, "catalog", {Map + " catalog:\n"}},
+      {u"CATLOG\"", Strict, false, NotLaunched, "catalog", {Quoted, "failed map", "Status = [-1]"}},
+      {u"CATLOG\"", Lenient, true, EFI_SUCCESS, "catalog", {Quoted}},
+      {nullptr, Strict, false, EFI_NOT_FOUND, "", {"none\n"}},
+      {nullptr, Lenient, true, EFI_SUCCESS, "", {}},
+  };
+  for (const Case &C : Cases) {
+    SCOPED_TRACE(C.Label != nullptr ? HostUcs2ToUtf8(C.Label) : "no share");
+    Share.Uninstall();
+    if (C.Label != nullptr) {
+      Console([&] { Share.Install(u"share", C.Label); });
+    }
+    uint64_t PoolBefore = HostPoolOutstanding();
+    CHAR16 DriveName[NWFS_DRIVE_NAME_CHARS + 1];
+    EFI_STATUS Status = EFI_SUCCESS;
+    bool GoesOn = false;
+    std::string Out = Console([&] {
+      GoesOn = MapShareUnderIdentifier(C.Label != nullptr ? C.Label : u"CIFS", C.Style, DriveName,
+                                       &Status);
+    });
+    EXPECT_EQ(GoesOn, C.GoesOn);
+    EXPECT_EQ(Status, C.Status);
+    EXPECT_EQ(HostUcs2ToUtf8(DriveName), C.DriveName);
+    const std::string Closing = "Exiting from GetFS_OLD_NWFS function \n";
+    size_t At = Out.rfind(Closing) + Closing.size();
+    EXPECT_EQ(At == Out.size(), C.Lines.empty()) << Out;
+    for (const std::string &Line : C.Lines) {
+      At = Out.find(Line, At);
+      EXPECT_NE(At, std::string::npos) << Line << " in " << Out;
+    }
+    EXPECT_EQ(HostPoolOutstanding(), PoolBefore);
+  }
 }
 
 // ---------------------------------------------------------------------------

@@ -216,14 +216,6 @@ bool IsPlainFileNameCharacter(UINT32 Character) {
          Character == '-';
 }
 
-bool IsPlainFileNameText(const CHAR8 *Text) {
-  return IsPlainText(Text);
-}
-
-bool IsPlainFileNameText(const CHAR16 *Text) {
-  return IsPlainText(Text);
-}
-
 EFI_STATUS BuildExportFileName(const CHAR8 *Tag, const CHAR8 *Word, const EFI_TIME &Time,
                                const CHAR8 *Extension, CHAR16 *Name, UINTN Chars) {
   // Formatted with room to spare, so that a name that had to be cut shows.

@@ -44,11 +44,9 @@ EFI_STATUS ExportTechSupportFileToNWShare(UINT32 Kind, const CHAR16 *DestPath, U
 // characters). EFI_BUFFER_TOO_SMALL when it does not fit.
 EFI_STATUS BuildExportFileName(const CHAR8 *Tag, const CHAR8 *Word, const EFI_TIME &Time,
                                const CHAR8 *Extension, CHAR16 *Name, UINTN Chars);
-// True for a non-empty name made only of letters, digits, '.', '_' and '-':
-// what may go into a shell command line and a file name unquoted.
+// True for a letter, a digit, '.', '_' or '-': what may go into a shell
+// command line and a file name unquoted.
 bool IsPlainFileNameCharacter(UINT32 Character);
-bool IsPlainFileNameText(const CHAR8 *Text);
-bool IsPlainFileNameText(const CHAR16 *Text);
 
 // ---------------------------------------------------------------------------
 // SMBIOS asset tag

@@ -28,24 +28,14 @@ constexpr const CHAR16 *kTechSupportPrefix = u"DGR";
 constexpr const CHAR16 *kVolumeRoot = u":\\";
 constexpr const CHAR16 *kSeparator = u"\\";
 
-// Step 6: maps the share under its type's name when its drive name differs.
-// False when the export cannot go on (*Status says why).
-bool MapShareForExport(const CHAR16 *ShareTypeName, const CHAR16 *DriveName, EFI_STATUS *Status) {
-  if (!DriveNeedsIdentifierMapping(DriveName, ShareTypeName)) {
-    return true;
-  }
-  CHAR16 *Command = BuildMapCommand(ShareTypeName, DriveName);
-  if (Command == nullptr) {
-    return false; // nothing exported, the status stays as it is
-  }
-  INTN RunnerResult = RunShellCommand(Command);
-  if (RunnerResult != 0) {
-    DiagLogW(DIAG_ALWAYS, u"ExportToNetworkDevice(): command failed, %s\n", Command);
-    *Status = static_cast<EFI_STATUS>(RunnerResult);
-  }
-  FreePool(Command);
-  return RunnerResult == 0;
-}
+// A share without a drive name is not found; a map command that cannot be
+// allocated ends the export with nothing exported, as a success.
+constexpr SHARE_MAPPING_STYLE kExportMapping = {
+    .NoDriveText = "Drive name not found!\n",
+    .NoDriveStatus = EFI_NOT_FOUND,
+    .NoMemoryStatus = EFI_SUCCESS,
+    .FailureText = u"ExportToNetworkDevice(): command failed, %s\n",
+};
 
 // Steps 7 and 8: the destination directory on the share. Null when it cannot
 // be allocated.
@@ -115,14 +105,8 @@ EFI_STATUS ExporttoNWShare(UINT32 ShareType, const CHAR16 *FileName, const CHAR1
   }
 
   EFI_STATUS Status = EFI_SUCCESS;
-  CHAR16 DriveName[NWFS_DRIVE_NAME_CHARS] = {};
-  // Only the drive name counts; the lookup's status is not looked at.
-  GetFS_OLD_NWFS(ShareTypeName, DriveName, NWFS_DRIVE_NAME_CHARS);
-  if (DriveName[0] == 0) {
-    DiagLog(DIAG_ALWAYS, "Drive name not found!\n");
-    Status = EFI_NOT_FOUND;
-    DiagLog(DIAG_TRACE, "Exiting from ExporttoNWShare()\n");
-  } else if (MapShareForExport(ShareTypeName, DriveName, &Status)) {
+  CHAR16 DriveName[NWFS_DRIVE_NAME_CHARS + 1];
+  if (MapShareUnderIdentifier(ShareTypeName, kExportMapping, DriveName, &Status)) {
     CHAR16 *Destination = BuildDestination(ShareType, DriveName, FileName);
     if (Destination == nullptr) {
       Status = EFI_OUT_OF_RESOURCES;
@@ -131,6 +115,8 @@ EFI_STATUS ExporttoNWShare(UINT32 ShareType, const CHAR16 *FileName, const CHAR1
       DiagLog(DIAG_TRACE, "Exiting from ExporttoNWShare()\n");
       FreePool(Destination);
     }
+  } else if (DriveName[0] == 0) {
+    DiagLog(DIAG_TRACE, "Exiting from ExporttoNWShare()\n");
   }
   DiagExit(Status, DiagChannel::Driver, "ExporttoNWShare");
   return Status;

@@ -222,30 +222,14 @@ void SwapShareNameSlashes(CHAR16 *Name) {
   }
 }
 
-// After a mount: the new volume is given a shell name, and is also mapped
-// under its identifier when that name differs. Only a command that cannot be
-// built fails.
-EFI_STATUS NameMountedVolume(const CHAR16 *Identifier) {
-  CHAR16 DriveName[NWFS_DRIVE_NAME_CHARS + 1] = {};
-  RefreshShellMappings();
-  GetFS_OLD_NWFS(Identifier, DriveName, NWFS_DRIVE_NAME_CHARS);
-  DiagLog(DIAG_VERBOSE, "driveName = %ls\n", DriveName);
-  if (DriveName[0] == 0) {
-    DiagLog(DIAG_ALWAYS, "Drive name len %ls is zero!\n", DriveName);
-    return EFI_SUCCESS;
-  }
-  DiagLog(DIAG_VERBOSE, "NWPartitions = %ls\n", DriveName);
-  if (!DriveNeedsIdentifierMapping(DriveName, Identifier)) {
-    return EFI_SUCCESS;
-  }
-  CHAR16 *Command = BuildMapCommand(Identifier, DriveName);
-  if (Command == nullptr) {
-    return EFI_OUT_OF_RESOURCES;
-  }
-  RunShellCommand(Command); // its result is deliberately not looked at
-  FreePool(Command);
-  return EFI_SUCCESS;
-}
+// After a mount the new volume is given a shell name, and is also mapped
+// under its identifier when that name differs. The map command's own result
+// is deliberately not looked at: only a command that cannot be built fails.
+constexpr SHARE_MAPPING_STYLE kMountMapping = {
+    .AfterMount = true,
+    .NoDriveText = "Drive name len %ls is zero!\n",
+    .FailureEnds = false,
+};
 
 } // namespace
 
@@ -273,8 +257,9 @@ EFI_STATUS StartMountFileSystem(const CHAR16 *ShareName, const CHAR16 *IpAddress
     }
   }
   if (Status == EFI_SUCCESS) {
-    EFI_STATUS NameStatus = NameMountedVolume(Identifier);
-    if (EFI_ERROR(NameStatus)) {
+    CHAR16 DriveName[NWFS_DRIVE_NAME_CHARS + 1];
+    EFI_STATUS NameStatus = EFI_SUCCESS;
+    if (!MapShareUnderIdentifier(Identifier, kMountMapping, DriveName, &NameStatus)) {
       return NameStatus;
     }
   }

@@ -40,7 +40,6 @@ INTN AsciiStrnCmp(const CHAR8 *A, const CHAR8 *B, UINTN Length);
 // Copies at most DestMax - 1 characters and always terminates (DestMax > 0).
 void AsciiStrCpyS(CHAR8 *Destination, UINTN DestMax, const CHAR8 *Source);
 void AsciiStrCatS(CHAR8 *Destination, UINTN DestMax, const CHAR8 *Source);
-const CHAR8 *AsciiStrStr(const CHAR8 *String, const CHAR8 *SearchString);
 const CHAR8 *AsciiStrChr(const CHAR8 *String, CHAR8 Character);
 // Decimal parse: leading white space, optional sign, digits.
 INT64 AsciiStrDecimalToInt(const CHAR8 *String);
@@ -59,7 +58,6 @@ CHAR16 *StrDup(const CHAR16 *String); // pool copy, null on failure
 
 // Conversions. The 8-bit side is taken as Latin-1; UCS-2 characters above
 // 0xFF narrow to '?'. Both always terminate within DestMax characters.
-void AsciiStrToUnicodeS(const CHAR8 *Source, CHAR16 *Destination, UINTN DestMax);
 void UnicodeStrToAsciiS(const CHAR16 *Source, CHAR8 *Destination, UINTN DestMax);
 CHAR16 *AsciiStrDupToUnicode(const CHAR8 *Source); // pool, length + 1 characters
 CHAR8 *UnicodeStrDupToAscii(const CHAR16 *Source); // pool, length + 1 characters
@@ -100,9 +98,6 @@ UINTN strtoUTF16(void *Out, const CHAR8 *Text, UINTN Maximum, const CHAR8 *Codep
 UINTN AsciiVSPrint(CHAR8 *Buffer, UINTN BufferSize, const CHAR8 *Format, va_list Args);
 UINTN AsciiSPrint(CHAR8 *Buffer, UINTN BufferSize, const CHAR8 *Format, ...);
 // UCS-2 output from an 8-bit format.
-UINTN UnicodeVSPrintAsciiFormat(CHAR16 *Buffer, UINTN BufferChars, const CHAR8 *Format,
-                                va_list Args);
 UINTN UnicodeSPrintAsciiFormat(CHAR16 *Buffer, UINTN BufferChars, const CHAR8 *Format, ...);
 // UCS-2 output from a UCS-2 format.
-UINTN UnicodeVSPrint(CHAR16 *Buffer, UINTN BufferChars, const CHAR16 *Format, va_list Args);
 UINTN UnicodeSPrint(CHAR16 *Buffer, UINTN BufferChars, const CHAR16 *Format, ...);

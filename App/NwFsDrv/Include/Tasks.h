@@ -2,6 +2,7 @@
 // and the pieces of them that the mount and the tests use.
 #pragma once
 
+#include "ShellCommand.h"
 #include "Uefi.h"
 
 // ---------------------------------------------------------------------------
@@ -11,13 +12,40 @@
 // The volume identifier of a share type: "CIFS" for 1, "NFS" otherwise. It is
 // also the shell name under which the tasks reach the share.
 const CHAR16 *ShareVolumeIdentifier(UINT64 ShareType);
-// True when DriveName is not empty and does not begin with Identifier: the
-// share then has to be mapped under its identifier as well.
-bool DriveNeedsIdentifierMapping(const CHAR16 *DriveName, const CHAR16 *Identifier);
-// Builds "map <Identifier> <DriveName>:" and prints "trying to map -->
-// command: ..."; the caller runs it and frees it. Null, after "Memory
-// allocation error for Command", when it cannot be allocated.
-CHAR16 *BuildMapCommand(const CHAR16 *Identifier, const CHAR16 *DriveName);
+
+// What a caller makes of the mapping below: the callers differ only in the
+// lines they print around it and in what ends them. By default nothing more
+// is printed, a share without a drive name lets the caller go on, and a map
+// command that cannot be built or launched ends it.
+struct SHARE_MAPPING_STYLE {
+  // Refresh the shell's mappings before the lookup, and report the drive name
+  // found ("driveName = ...", "NWPartitions = ...") at the verbose level.
+  bool AfterMount = false;
+  // Printed, with the empty drive name, when the share has no drive name.
+  const CHAR8 *NoDriveText = nullptr;
+  // The caller's result when the share has no drive name; an error ends it.
+  EFI_STATUS NoDriveStatus = EFI_SUCCESS;
+  // The caller's result when the map command cannot be allocated, which
+  // always ends it.
+  EFI_STATUS NoMemoryStatus = EFI_OUT_OF_RESOURCES;
+  // Printed with the map command before it runs.
+  const CHAR8 *CommandText = nullptr;
+  // Whether a map command the shell could not launch ends the caller, with
+  // the runner's result.
+  bool FailureEnds = true;
+  // Printed (UCS-2 format) with the map command when its failure ends the
+  // caller; FailureStatusLine adds the line "\n (<line>)Status = [<status>]".
+  const CHAR16 *FailureText = nullptr;
+  bool FailureStatusLine = false;
+};
+
+// Looks up the shell name of the volume labelled Identifier into DriveName
+// and, when that name does not begin with Identifier, maps the volume under
+// Identifier as well ("map <Identifier> <DriveName>:", announced with "trying
+// to map --> command: ..."). True when the caller goes on; otherwise *Status
+// is the caller's result.
+bool MapShareUnderIdentifier(const CHAR16 *Identifier, const SHARE_MAPPING_STYLE &Style,
+                             CHAR16 (&DriveName)[NWFS_DRIVE_NAME_CHARS + 1], EFI_STATUS *Status);
 
 // ---------------------------------------------------------------------------
 // Catalog retrieval (action G)

@@ -143,9 +143,6 @@ void AsciiStrCpyS(CHAR8 *Destination, UINTN DestMax, const CHAR8 *Source) {
 void AsciiStrCatS(CHAR8 *Destination, UINTN DestMax, const CHAR8 *Source) {
   CatBounded(Destination, DestMax, Source);
 }
-const CHAR8 *AsciiStrStr(const CHAR8 *String, const CHAR8 *SearchString) {
-  return Find(String, SearchString);
-}
 
 const CHAR8 *AsciiStrChr(const CHAR8 *String, CHAR8 Character) {
   if (String == nullptr) {
@@ -217,9 +214,6 @@ CHAR16 *StrDup(const CHAR16 *String) {
 // ---------------------------------------------------------------------------
 // Conversions
 // ---------------------------------------------------------------------------
-void AsciiStrToUnicodeS(const CHAR8 *Source, CHAR16 *Destination, UINTN DestMax) {
-  ConvertBounded<CHAR8, CHAR16, Widen>(Source, Destination, DestMax);
-}
 void UnicodeStrToAsciiS(const CHAR16 *Source, CHAR8 *Destination, UINTN DestMax) {
   ConvertBounded<CHAR16, CHAR8, Narrow>(Source, Destination, DestMax);
 }

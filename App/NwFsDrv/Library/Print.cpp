@@ -483,21 +483,12 @@ UINTN AsciiSPrint(CHAR8 *Buffer, UINTN BufferSize, const CHAR8 *Format, ...) {
   return Count;
 }
 
-UINTN UnicodeVSPrintAsciiFormat(CHAR16 *Buffer, UINTN BufferChars, const CHAR8 *Format,
-                                va_list Args) {
-  return PrintToBuffer(Buffer, BufferChars, Format, Args);
-}
-
 UINTN UnicodeSPrintAsciiFormat(CHAR16 *Buffer, UINTN BufferChars, const CHAR8 *Format, ...) {
   va_list Args;
   va_start(Args, Format);
   const UINTN Count = PrintToBuffer(Buffer, BufferChars, Format, Args);
   va_end(Args);
   return Count;
-}
-
-UINTN UnicodeVSPrint(CHAR16 *Buffer, UINTN BufferChars, const CHAR16 *Format, va_list Args) {
-  return PrintToBuffer(Buffer, BufferChars, Format, Args);
 }
 
 UINTN UnicodeSPrint(CHAR16 *Buffer, UINTN BufferChars, const CHAR16 *Format, ...) {

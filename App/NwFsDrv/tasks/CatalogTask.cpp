@@ -73,18 +73,10 @@ EFI_STATUS GetCatalogFromNwFS(UINT32 ShareType, const CHAR16 *CatalogDir, BOOLEA
   ResetCatalogEnvVar(&Kind);
 
   const CHAR16 *Identifier = ShareVolumeIdentifier(ShareType);
-  CHAR16 DriveName[NWFS_DRIVE_NAME_CHARS + 1] = {};
-  GetFS_OLD_NWFS(Identifier, DriveName, NWFS_DRIVE_NAME_CHARS);
-  if (DriveNeedsIdentifierMapping(DriveName, Identifier)) {
-    CHAR16 *Command = BuildMapCommand(Identifier, DriveName);
-    if (Command == nullptr) {
-      return EFI_OUT_OF_RESOURCES;
-    }
-    INTN RunnerResult = RunShellCommand(Command);
-    FreePool(Command);
-    if (RunnerResult != 0) {
-      return static_cast<EFI_STATUS>(RunnerResult);
-    }
+  CHAR16 DriveName[NWFS_DRIVE_NAME_CHARS + 1];
+  EFI_STATUS Status = EFI_SUCCESS;
+  if (!MapShareUnderIdentifier(Identifier, SHARE_MAPPING_STYLE{}, DriveName, &Status)) {
+    return Status;
   }
 
   bool DirectoryGiven = CatalogDir != nullptr && CatalogDir[0] != 0;
@@ -94,12 +86,12 @@ EFI_STATUS GetCatalogFromNwFS(UINT32 ShareType, const CHAR16 *CatalogDir, BOOLEA
       return EFI_OUT_OF_RESOURCES;
     }
     DiagLog(DIAG_ALWAYS, "\ncatalogPath = %ls", SearchPath);
-    EFI_STATUS Status = SearchCatalog(SearchPath, ShareType, false);
+    Status = SearchCatalog(SearchPath, ShareType, false);
     FreePool(SearchPath);
     return Status;
   }
 
-  EFI_STATUS Status = EFI_NOT_FOUND;
+  Status = EFI_NOT_FOUND;
   for (const CHAR16 *Directory : kDefaultDirectories) {
     CHAR16 *SearchPath = BuildSearchPath(Identifier, Directory, Directory == nullptr);
     if (SearchPath == nullptr) {

@@ -20,10 +20,6 @@ void PrintCopyCommand(const CHAR16 *Identifier, const CHAR16 *FilePath, const CH
   DiagLog(DIAG_ALWAYS, "\n (%d)command = [%ls]\n", Line, Command);
 }
 
-void PrintStatus(EFI_STATUS Status, UINT32 Line = __builtin_LINE()) {
-  DiagLog(DIAG_ALWAYS, "\n (%d)Status = [%d]\n", Line, static_cast<INT32>(Status));
-}
-
 void ReplaceForwardSlashes(CHAR16 *Text) {
   for (; *Text != 0; Text++) {
     if (*Text == u'/') {
@@ -47,29 +43,12 @@ bool AttemptCopy(const CHAR16 *Command, const CHAR16 *CheckPath, EFI_STATUS *Sta
   return false;
 }
 
-// Maps the share under its identifier when its shell name differs. Returns
-// false (with *Status set) when the import cannot go on.
-bool MapShareForImport(const CHAR16 *Identifier, EFI_STATUS *Status) {
-  CHAR16 DriveName[NWFS_DRIVE_NAME_CHARS + 1] = {};
-  GetFS_OLD_NWFS(Identifier, DriveName, NWFS_DRIVE_NAME_CHARS);
-  if (!DriveNeedsIdentifierMapping(DriveName, Identifier)) {
-    return true;
-  }
-  CHAR16 *Command = BuildMapCommand(Identifier, DriveName);
-  if (Command == nullptr) {
-    *Status = EFI_OUT_OF_RESOURCES;
-    return false;
-  }
-  DiagLog(DIAG_ALWAYS, "\n 1 .)command = [%ls]\n", Command);
-  INTN RunnerResult = RunShellCommand(Command);
-  if (RunnerResult != 0) {
-    DiagLogW(DIAG_ALWAYS, u"GetFileFromNWFS(): command failed, %s\n", Command);
-    *Status = static_cast<EFI_STATUS>(RunnerResult);
-    PrintStatus(*Status);
-  }
-  FreePool(Command);
-  return RunnerResult == 0;
-}
+// The import echoes the map command and reports a failed one with its status.
+constexpr SHARE_MAPPING_STYLE kImportMapping = {
+    .CommandText = "\n 1 .)command = [%ls]\n",
+    .FailureText = u"GetFileFromNWFS(): command failed, %s\n",
+    .FailureStatusLine = true,
+};
 
 } // namespace
 
@@ -81,7 +60,8 @@ EFI_STATUS GetFileFromNWFS(UINT32 ShareType, const CHAR16 *FilePath, const CHAR1
   }
   const CHAR16 *Identifier = ShareVolumeIdentifier(ShareType);
   EFI_STATUS Status = EFI_SUCCESS;
-  if (!MapShareForImport(Identifier, &Status)) {
+  CHAR16 DriveName[NWFS_DRIVE_NAME_CHARS + 1];
+  if (!MapShareUnderIdentifier(Identifier, kImportMapping, DriveName, &Status)) {
     return Status;
   }
 
@@ -116,7 +96,7 @@ EFI_STATUS GetFileFromNWFS(UINT32 ShareType, const CHAR16 *FilePath, const CHAR1
       DiagLogW(DIAG_ALWAYS, u"GetFileFromNWFS(): command failed, %s\n", Command);
     }
   }
-  PrintStatus(Status);
+  PrintCommandStatus(Status);
   FreePool(CheckPath8);
   FreePool(CheckPath);
   FreePool(Command);

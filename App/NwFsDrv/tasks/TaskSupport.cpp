@@ -67,6 +67,10 @@ EFI_STATUS RunSystemCommandW(const CHAR16 *CommandLine) {
   return CommandOutcome(RunShellCommand(CommandLine));
 }
 
+void PrintCommandStatus(EFI_STATUS Status, UINT32 Line) {
+  DiagLog(DIAG_ALWAYS, "\n (%d)Status = [%d]\n", Line, static_cast<INT32>(Status));
+}
+
 bool ShellFileOpens(const CHAR16 *Path) {
   EFI_SHELL_PROTOCOL *Shell = CurrentShell();
   if (Path == nullptr || Shell == nullptr || Shell->OpenFileByName == nullptr) {
@@ -95,11 +99,10 @@ const CHAR16 *ShareVolumeIdentifier(UINT64 ShareType) {
   return ShareType == NWFS_SHARE_TYPE_CIFS ? u"CIFS" : u"NFS";
 }
 
-bool DriveNeedsIdentifierMapping(const CHAR16 *DriveName, const CHAR16 *Identifier) {
-  return DriveName != nullptr && DriveName[0] != 0 &&
-         StrnCmp(DriveName, Identifier, StrLen(Identifier)) != 0;
-}
+namespace {
 
+// "map <Identifier> <DriveName>:", announced on the console. Null, after the
+// allocation-failure line, when it cannot be allocated.
 CHAR16 *BuildMapCommand(const CHAR16 *Identifier, const CHAR16 *DriveName) {
   constexpr const CHAR16 *kMap = u"map";
   // "map", the two spaces, the drive name, its colon and the terminator.
@@ -112,4 +115,56 @@ CHAR16 *BuildMapCommand(const CHAR16 *Identifier, const CHAR16 *DriveName) {
   UnicodeSPrint(Command, Chars, u"%s %s %s:", kMap, Identifier, DriveName);
   DiagLogW(DIAG_ALWAYS, u"trying to map --> command: %s\n", Command);
   return Command;
+}
+
+} // namespace
+
+bool MapShareUnderIdentifier(const CHAR16 *Identifier, const SHARE_MAPPING_STYLE &Style,
+                             CHAR16 (&DriveName)[NWFS_DRIVE_NAME_CHARS + 1], EFI_STATUS *Status) {
+  ZeroMem(DriveName, sizeof(DriveName));
+  if (Style.AfterMount) {
+    RefreshShellMappings();
+  }
+  GetFS_OLD_NWFS(Identifier, DriveName, NWFS_DRIVE_NAME_CHARS);
+  if (Style.AfterMount) {
+    DiagLog(DIAG_VERBOSE, "driveName = %ls\n", DriveName);
+  }
+  if (DriveName[0] == 0) {
+    if (Style.NoDriveText != nullptr) {
+      DiagLog(DIAG_ALWAYS, Style.NoDriveText, DriveName);
+    }
+    if (EFI_ERROR(Style.NoDriveStatus)) {
+      *Status = Style.NoDriveStatus;
+      return false;
+    }
+    return true;
+  }
+  if (Style.AfterMount) {
+    DiagLog(DIAG_VERBOSE, "NWPartitions = %ls\n", DriveName);
+  }
+  if (StrnCmp(DriveName, Identifier, StrLen(Identifier)) == 0) {
+    return true; // already reachable under its identifier
+  }
+
+  CHAR16 *Command = BuildMapCommand(Identifier, DriveName);
+  if (Command == nullptr) {
+    *Status = Style.NoMemoryStatus;
+    return false;
+  }
+  if (Style.CommandText != nullptr) {
+    DiagLog(DIAG_ALWAYS, Style.CommandText, Command);
+  }
+  INTN RunnerResult = RunShellCommand(Command);
+  bool Ends = RunnerResult != 0 && Style.FailureEnds;
+  if (Ends) {
+    if (Style.FailureText != nullptr) {
+      DiagLogW(DIAG_ALWAYS, Style.FailureText, Command);
+    }
+    *Status = static_cast<EFI_STATUS>(RunnerResult);
+    if (Style.FailureStatusLine) {
+      PrintCommandStatus(*Status);
+    }
+  }
+  FreePool(Command);
+  return !Ends;
 }

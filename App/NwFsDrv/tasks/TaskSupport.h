@@ -23,6 +23,10 @@ CHAR8 *JoinAscii(const CHAR8 *const (&Parts)[N]) {
 EFI_STATUS RunSystemCommand(const CHAR8 *CommandLine);
 EFI_STATUS RunSystemCommandW(const CHAR16 *CommandLine);
 
+// Prints the status line "\n (<line>)Status = [<status>]\n" with the caller's
+// source line.
+void PrintCommandStatus(EFI_STATUS Status, UINT32 Line = __builtin_LINE());
+
 // True when Path opens for reading through the shell; the file is closed
 // again at once.
 bool ShellFileOpens(const CHAR16 *Path);
