@@ -253,6 +253,7 @@ EFI_STATUS SMB2_Connect(SMB2ConnectInfo *ConnectInfo, SMB2ShareDetails *Share) {
   FreePool(TransactDetails.ChallResponse);
   ZeroMem(&TransactDetails, sizeof(TransactDetails));
   SMB2ConnectionState = SMB2_STATE_CLOSED;
+  SMB2ResetConnectionHealth();
   if (ConnectInfo == nullptr || Share == nullptr) {
     DiagNullInput();
     return EFI_INVALID_PARAMETER;
@@ -302,16 +303,26 @@ EFI_STATUS SMB2_Disconnect(SMB2ConnectInfo *ConnectInfo, SMB2ShareDetails *Share
   }
   INT32 SockFd = gSMB2SockFd;
   EFI_STATUS Status = EFI_SUCCESS;
-  if (SMB2ConnectionState >= SMB2_STATE_TREE) {
-    EFI_STATUS Tree =
-        SMB2MapNtStatus(SMB2TreeDisconnect(&TransactDetails, SockFd), "SMB2TreeDisconnect");
-    if (EFI_ERROR(Tree)) {
-      Status = Tree;
+  if (SMB2ConnectionBroken()) {
+    // Nothing more goes out on a broken connection: the socket is closed
+    // without the tree disconnect and the logoff.
+    Smb2Log(DIAG_ALWAYS,
+            "Function: %s, Line no.: = %d, The connection is broken: closing it without a tree "
+            "disconnect and a logoff.\n",
+            __func__, __LINE__);
+    Status = EFI_DEVICE_ERROR;
+  } else {
+    if (SMB2ConnectionState >= SMB2_STATE_TREE) {
+      EFI_STATUS Tree =
+          SMB2MapNtStatus(SMB2TreeDisconnect(&TransactDetails, SockFd), "SMB2TreeDisconnect");
+      if (EFI_ERROR(Tree)) {
+        Status = Tree;
+      }
     }
-  }
-  EFI_STATUS LogOff = SMB2MapNtStatus(SMB2LogOff(&TransactDetails, SockFd), "SMB2LogOff");
-  if (EFI_ERROR(LogOff)) {
-    Status = LogOff;
+    EFI_STATUS LogOff = SMB2MapNtStatus(SMB2LogOff(&TransactDetails, SockFd), "SMB2LogOff");
+    if (EFI_ERROR(LogOff)) {
+      Status = LogOff;
+    }
   }
   INT32 Closed = TCP_CloseSocket(SockFd);
   if (Closed != 0) {

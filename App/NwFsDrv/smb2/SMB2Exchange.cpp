@@ -15,6 +15,15 @@ UINT64 gSMB2RequestCount;
 
 namespace {
 
+// 0 while the connection is healthy, else the code it broke with.
+UINT32 gBrokenCode;
+
+void MarkBroken(UINT32 Code) {
+  if (gBrokenCode == SMB2_NT_SUCCESS) {
+    gBrokenCode = Code != SMB2_NT_SUCCESS ? Code : STATUS_UNSUCCESSFUL;
+  }
+}
+
 bool SessionCodes(const SMB2_COMMAND *Command) {
   return (Command->Flags & SMB2_COMMAND_SESSION_CODES) != 0;
 }
@@ -89,7 +98,9 @@ UINT32 SendRequest(const SMB2_COMMAND *Command, void *Context) {
   if (Code == STATUS_NO_MEMORY || Code == SMB2_NT_INVALID_PARAMETER) {
     return Code;
   }
-  return TransportFailureCode(Command, static_cast<INT32>(Code));
+  Code = TransportFailureCode(Command, static_cast<INT32>(Code));
+  MarkBroken(Code);
+  return Code;
 }
 
 // The bytes of one answer's frame that are still to come.
@@ -132,6 +143,7 @@ INT32 FrameSkip(FRAME_READER *Frame, UINT64 Length) {
 }
 
 // A body read that did not complete: its lines, and the code it ends with.
+// (The frame reader has noted the failure: the connection is given up.)
 UINT32 BodyFailure(const SMB2_COMMAND *Command, INT32 Rx) {
   const SMB2_RECEIVE_TEXTS *Texts = Command->Receive;
   if (Rx == NwErrno::ETIMEDOUT_ && Texts->BodyTimedOut != nullptr) {
@@ -204,9 +216,13 @@ UINT32 ReceiveAnswer(const SMB2_COMMAND *Command, void *Context) {
   SMB2_RESPONSE Response;
   ZeroMem(&Response, sizeof(Response));
   UINT32 Nt = STATUS_UNSUCCESSFUL;
-  EFI_STATUS Status = SMB2ReadVerifyHeader(&Response.Header, &TransactDetails, gSMB2SockFd, &Nt);
+  EFI_STATUS Status =
+      SMB2ReadVerifyHeader(&Response.Header, &TransactDetails, gSMB2SockFd, &Nt, Command->Command);
   if (EFI_ERROR(Status)) {
     ReportHeaderFailure(Command, Status);
+    if (Status == EFI_PROTOCOL_ERROR || Status == EFI_COMPROMISED_DATA) {
+      MarkBroken(STATUS_UNSUCCESSFUL);
+    }
     return STATUS_UNSUCCESSFUL;
   }
   Response.BodyLength = SMB2BodyLength(&Response.Header);
@@ -236,6 +252,9 @@ UINT32 ReceiveAnswer(const SMB2_COMMAND *Command, void *Context) {
     if (Rx != 0 && Code == SMB2_NT_SUCCESS) {
       Code = BodyFailure(Command, Rx);
     }
+  }
+  if (Frame.Failed) {
+    MarkBroken(Code);
   }
   if (Code == SMB2_NT_SUCCESS) {
     Code = Command->Decode(Context, &Response);
@@ -295,8 +314,22 @@ const UINT8 *SMB2ResponseRange(const SMB2_RESPONSE *Response, UINT64 Offset, UIN
   return Response->Variable + (Offset - Start);
 }
 
+bool SMB2ConnectionBroken() {
+  return gBrokenCode != SMB2_NT_SUCCESS;
+}
+
+void SMB2ResetConnectionHealth() {
+  gBrokenCode = SMB2_NT_SUCCESS;
+}
+
 SMB2_EXCHANGE_RESULT SMB2Exchange(const SMB2_COMMAND *Command, void *Context) {
   SMB2_EXCHANGE_RESULT Result = {SMB2_NT_SUCCESS, SMB2_NT_SUCCESS};
+  if (SMB2ConnectionBroken()) {
+    Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, The connection is broken: not sent!\n",
+            Command->RequestName, __LINE__);
+    Result.RequestCode = gBrokenCode;
+    return Result;
+  }
   Result.RequestCode = SendRequest(Command, Context);
   if (Result.RequestCode == SMB2_NT_SUCCESS) {
     Result.ResponseCode = ReceiveAnswer(Command, Context);

@@ -161,6 +161,16 @@ void SMB2LayRequest(SMB2_REQUEST *Request, const void *Packet, UINT32 PacketSize
 void SMB2AddPiece(SMB2_REQUEST *Request, const void *Bytes, UINT64 Length);
 
 // ---------------------------------------------------------------------------
+// The connection's health. After a transport failure (time-out, reset,
+// close, short frame) or an answer that puts the stream out of step, the
+// connection is broken: nothing more is sent on it, and every later exchange
+// fails at once with the code the breaking one ended with. A connect starts
+// a healthy connection.
+// ---------------------------------------------------------------------------
+bool SMB2ConnectionBroken();
+void SMB2ResetConnectionHealth();
+
+// ---------------------------------------------------------------------------
 // The request trace: every request as it was sent, for tests and
 // diagnostics (a ring of the most recent ones and a running count).
 // ---------------------------------------------------------------------------

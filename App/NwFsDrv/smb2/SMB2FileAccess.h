@@ -459,6 +459,9 @@ constexpr UINT32 SMB2_QUERY_INFO_OUTPUT_LENGTH = 8293;
 // The input buffer's offset from the SMB2 header: right behind the fixed part.
 constexpr UINT16 SMB2_QUERY_INFO_INPUT_OFFSET = offsetof(SMB2_QUERY_INFO_REQUEST, Buffer) - 4;
 constexpr UINT32 SMB2_QUERY_DIRECTORY_OUTPUT_LENGTH = 16384;
+// Room kept for alignment padding between a query answer's fixed body and
+// its output.
+constexpr UINT32 SMB2_QUERY_OUTPUT_PADDING = 8;
 constexpr UINT16 SMB2_QUERY_DIRECTORY_NAME_OFFSET = 96; // from the SMB2 header
 // Extra zeroed bytes behind a stored directory answer.
 constexpr UINT32 SMB2_DIR_INFO_SLACK = 72;

@@ -84,11 +84,6 @@ void SetReadOnlyOpen(UINT8 Oplock) {
   F.OpenMode = kOpenModeRead;
 }
 
-// The next request's length: what is left, at most one request's worth.
-UINT32 ChunkLength(UINTN Left) {
-  return static_cast<UINT32>(Left < SMB2_FS_MAX_CHUNK ? Left : SMB2_FS_MAX_CHUNK);
-}
-
 // The per-transfer preparation shared by read and write.
 void PrepareTransfer(const NW_REMOTE_FILE *File, UINT64 Offset, UINT32 Length) {
   FILE_ACCESS_DETAILS &F = Access();
@@ -101,6 +96,76 @@ void PrepareTransfer(const NW_REMOTE_FILE *File, UINT64 Offset, UINT32 Length) {
   F.ReadWriteInfo.RemainingBytes = 0;
   F.ReadWriteInfo.ChannelInfoLength = 0;
   CopyMem(F.FileId, File->FileId, SMB2_FILE_ID_SIZE);
+}
+
+// A failed request of a transfer: its line, and the read's special cases.
+void ReportTransferFailure(bool Write, EFI_STATUS *Status) {
+  if (Write) {
+    DiagError("SMB2_Write failed!", *Status, "SMB2_FWrite", __LINE__);
+    return;
+  }
+  DiagError("SMB2_Read Failed!", *Status, "SMB2_FRead", __LINE__);
+  if (Access().TransportStatus == static_cast<UINT32>(NwErrno::ECONNRESET_)) {
+    Smb2Log(DIAG_ALWAYS, "Server has reset, so exiting!\n");
+  } else if (gSMB2ShareDetails.LastStatus == STATUS_END_OF_FILE) {
+    // A read never writes the last status, so within a read this still
+    // holds what the preparation set; the rule is kept as it stands.
+    Smb2Log(DIAG_ALWAYS,
+            "All the file bytes are read. Requested extra bytes. Exiting as success!\n");
+    *Status = EFI_SUCCESS;
+  }
+}
+
+// The most one request carries: 64512 bytes, or the server's negotiated
+// maximum when that is smaller.
+UINT32 RequestCap(bool Write) {
+  UINT32 Max = Write ? gSMB2ShareDetails.MaxWriteSize : gSMB2ShareDetails.MaxReadSize;
+  return Max != 0 && Max < SMB2_FS_MAX_CHUNK ? Max : SMB2_FS_MAX_CHUNK;
+}
+
+// The read or the write of *Size bytes at the prepared offset, in requests
+// of at most RequestCap bytes, each advancing by what the server moved. An
+// answer that moves nothing (a read without data before the end asked for, a
+// write the server did not take), or more short answers than allowed, fails
+// the transfer. *Size receives what was moved.
+EFI_STATUS Transfer(bool Write, UINT8 *Buffer, UINTN *Size) {
+  FILE_ACCESS_DETAILS &F = Access();
+  SMB2_READ_WRITE_INFO &Rw = F.ReadWriteInfo;
+  const UINTN Requested = *Size;
+  const UINT32 Cap = RequestCap(Write);
+  UINTN Total = 0;
+  UINT32 ShortAnswers = 0;
+  EFI_STATUS Status = EFI_SUCCESS;
+  while (Total < Requested) {
+    Rw.Length = static_cast<UINT32>(Requested - Total < Cap ? Requested - Total : Cap);
+    Rw.BytesRead = 0;
+    Rw.BytesWritten = 0;
+    Status = Write ? SMB2_Write(&gSMB2ShareDetails, &gSMB2ClientSession, &gQueryDetails, &F,
+                                Buffer + Total)
+                   : SMB2_Read(&gSMB2ShareDetails, &gSMB2ClientSession, &gQueryDetails, &F,
+                               Buffer + Total);
+    if (EFI_ERROR(Status)) {
+      ReportTransferFailure(Write, &Status);
+      break;
+    }
+    UINT64 Moved = Write ? Rw.BytesWritten : Rw.BytesRead;
+    if (Moved < Rw.Length && (Moved == 0 || ++ShortAnswers > SMB2_FS_MAX_SHORT_ANSWERS)) {
+      Smb2Log(DIAG_ALWAYS,
+              "Function: %s, Line no.: = %d, %s of %u bytes at offset %ld moved %ld bytes!\n",
+              Write ? "SMB2_FWrite" : "SMB2_FRead", __LINE__, Write ? "WRITE" : "READ", Rw.Length,
+              static_cast<INT64>(Rw.FileOffset), static_cast<INT64>(Moved));
+      Status = EFI_DEVICE_ERROR;
+      break;
+    }
+    Total += static_cast<UINTN>(Moved);
+    Rw.FileOffset += Moved;
+  }
+  if (Write && Total == Requested && Requested != 0) {
+    Smb2Log(DIAG_VERBOSE, "%s: All the bytes %ld are written\n", "SMB2_FWrite",
+            static_cast<INT64>(Total));
+  }
+  *Size = Total;
+  return Status;
 }
 
 // Opens the current FileName for reading when no file is open. *Opened
@@ -142,6 +207,9 @@ void ReleaseListing() {
 void ReleaseConnectBuffers() {
   FreePool(gSMB2ConnectInfo.IpAddress);
   FreePool(gSMB2ConnectInfo.Username);
+  if (gSMB2ConnectInfo.Password != nullptr) {
+    ZeroMem(gSMB2ConnectInfo.Password, SMB2_FS_PASSWORD_BUFFER);
+  }
   FreePool(gSMB2ConnectInfo.Password);
   FreePool(gSMB2ConnectInfo.Domain);
   FreePool(gSMB2ShareDetails.Sharename);
@@ -267,6 +335,7 @@ EFI_STATUS SMB2_FSResetState() {
   FreePool(TransactDetails.ChallResponse);
   ZeroMem(&TransactDetails, sizeof(TransactDetails));
   SMB2ConnectionState = SMB2_STATE_CLOSED;
+  SMB2ResetConnectionHealth();
   gSMB2AdapterState = 0;
   return EFI_SUCCESS;
 }
@@ -370,40 +439,8 @@ EFI_STATUS SMB2_FRead(NW_SHARE_INFO *Volume, NW_REMOTE_FILE *File, void *Buffer,
   if (Volume == nullptr || File == nullptr || Buffer == nullptr || Size == nullptr) {
     return InvalidParameter(__func__);
   }
-  FILE_ACCESS_DETAILS &F = Access();
-  UINTN Requested = *Size;
-  PrepareTransfer(File, Offset, static_cast<UINT32>(Requested));
-  UINT8 *Destination = static_cast<UINT8 *>(Buffer);
-  UINTN Total = 0;
-  EFI_STATUS Status = EFI_SUCCESS;
-  while (Total < Requested) {
-    F.ReadWriteInfo.BytesRead = 0;
-    F.ReadWriteInfo.Length = ChunkLength(Requested - Total);
-    Status =
-        SMB2_Read(&gSMB2ShareDetails, &gSMB2ClientSession, &gQueryDetails, &F, Destination + Total);
-    if (EFI_ERROR(Status)) {
-      DiagError("SMB2_Read Failed!", Status);
-      if (F.TransportStatus == static_cast<UINT32>(NwErrno::ECONNRESET_)) {
-        Smb2Log(DIAG_ALWAYS, "Server has reset, so exiting!\n");
-      } else if (gSMB2ShareDetails.LastStatus == STATUS_END_OF_FILE) {
-        // A read never writes the last status, so within a read this still
-        // holds what was set above; the rule is kept as it stands.
-        Smb2Log(DIAG_ALWAYS,
-                "All the file bytes are read. Requested extra bytes. Exiting as success!\n");
-        Status = EFI_SUCCESS;
-      }
-      break;
-    }
-    UINT64 Got = F.ReadWriteInfo.BytesRead;
-    if (Got == 0) {
-      // An answer without data would never finish the loop.
-      break;
-    }
-    Total += Got;
-    F.ReadWriteInfo.FileOffset += Got;
-  }
-  *Size = Total;
-  return Status;
+  PrepareTransfer(File, Offset, static_cast<UINT32>(*Size));
+  return Transfer(false, static_cast<UINT8 *>(Buffer), Size);
 }
 
 EFI_STATUS SMB2_FWrite(NW_SHARE_INFO *Volume, NW_REMOTE_FILE *File, const void *Buffer, UINTN *Size,
@@ -411,29 +448,11 @@ EFI_STATUS SMB2_FWrite(NW_SHARE_INFO *Volume, NW_REMOTE_FILE *File, const void *
   if (Volume == nullptr || File == nullptr || Buffer == nullptr || Size == nullptr) {
     return InvalidParameter(__func__);
   }
-  FILE_ACCESS_DETAILS &F = Access();
-  UINTN Requested = *Size;
   // The query record doubles as the write channel-info record: no channel.
   gQueryDetails.InputBufferLength = 0;
-  PrepareTransfer(File, Offset, static_cast<UINT32>(Requested));
-  UINTN Total = 0;
-  EFI_STATUS Status = EFI_SUCCESS;
-  if (Requested > 0) {
-    F.ReadWriteInfo.BytesWritten = 0;
-    Status = SMB2_Write(&gSMB2ShareDetails, &gSMB2ClientSession, &gQueryDetails, &F, Buffer);
-    if (EFI_ERROR(Status)) {
-      DiagError("SMB2_Write failed!", Status);
-    } else {
-      Total = static_cast<UINTN>(F.ReadWriteInfo.BytesWritten);
-      F.ReadWriteInfo.FileOffset += Total;
-      if (Total == Requested) {
-        Smb2Log(DIAG_VERBOSE, "%s: All the bytes %ld are written\n", __func__,
-                static_cast<INT64>(Total));
-      }
-    }
-  }
-  *Size = Total;
-  Smb2Log(DIAG_VERBOSE, "%s: Total bytes written = %ld\n", __func__, static_cast<INT64>(Total));
+  PrepareTransfer(File, Offset, static_cast<UINT32>(*Size));
+  EFI_STATUS Status = Transfer(true, static_cast<UINT8 *>(const_cast<void *>(Buffer)), Size);
+  Smb2Log(DIAG_VERBOSE, "%s: Total bytes written = %ld\n", __func__, static_cast<INT64>(*Size));
   return Status;
 }
 

@@ -38,9 +38,13 @@ constexpr UINTN SMB2_FS_DOMAIN_BUFFER = 256;
 constexpr UINTN SMB2_FS_SHARENAME_BUFFER = 336;
 constexpr UINTN SMB2_FS_LOGIN_CHARS = 510;
 constexpr UINTN SMB2_FS_SHARE_CHARS = 80;
-// Reads are cut into requests of at most this many bytes; a write is sent
-// as the one request it is handed (the volume hands over at most this much).
+// Transfers are cut into requests of at most this many bytes, or of the
+// server's negotiated maximum when that is smaller (the volume hands over
+// writes of at most this much, so a write is one request on most servers).
+// A server may answer a request with less than asked; at most this many
+// such short answers are taken in one transfer.
 constexpr UINT32 SMB2_FS_MAX_CHUNK = 64512;
+constexpr UINT32 SMB2_FS_MAX_SHORT_ANSWERS = 16;
 // The least an EFI_FILE_INFO handed out occupies: the volume copies this
 // much of it as its directory-entry record.
 constexpr UINTN SMB2_FS_MIN_FILE_INFO_ALLOCATION = 88;

@@ -4,6 +4,7 @@
 
 #include "DiagLog.h"
 #include "NwBaseLib.h"
+#include "NwPlatform.h"
 #include "smb2/TcpTransport.h"
 
 INT32 gSMB2SockFd;
@@ -220,14 +221,81 @@ UINT32 SMB2DrainRefused(INT32 SockFd, const SMB2_HEADER *Header, UINT32 BodyByte
 }
 
 namespace {
-// An interim answer: STATUS_PENDING says only that the final answer follows.
-bool IsInterimResponse(const SMB2_HEADER *Header) {
-  return Header->Status == STATUS_PENDING;
+
+// Answers the header read passes over on its way to the final one: interim
+// answers (STATUS_PENDING says only that the final answer follows) and
+// unsolicited notifications.
+bool IsSkippedAnswer(const SMB2_HEADER *Header, const TRANSACT_DETAILS *Details) {
+  if (Header->MessageId == SMB2_NOTIFICATION_MESSAGE_ID) {
+    return true;
+  }
+  return Header->Status == STATUS_PENDING && Header->MessageId == Details->MessageId;
 }
+
+UINT64 NowMicroseconds() {
+  NwTimeVal Tv;
+  ZeroMem(&Tv, sizeof(Tv));
+  NwGetTimeOfDay(&Tv);
+  return static_cast<UINT64>(Tv.tv_sec) * 1000000u + static_cast<UINT64>(Tv.tv_usec);
+}
+
+// Receives the header of the final answer, passing over skipped answers.
+INT32 ReceiveFinalHeader(UINT8 *Buffer, TRANSACT_DETAILS *Details, INT32 SockFd, INT64 *BytesRead) {
+  const SMB2_HEADER *Received = reinterpret_cast<const SMB2_HEADER *>(Buffer);
+  INT32 Rx = SMB2ReceiveAll(SockFd, Buffer, SMB2_FRAMED_HEADER_SIZE, Details, BytesRead);
+  UINT64 Since = 0;
+  for (UINT32 Skipped = 0; Rx == 0 && IsSkippedAnswer(Received, Details); Skipped++) {
+    UINT64 Now = NowMicroseconds();
+    Since = Skipped == 0 ? Now : Since;
+    if (Skipped == SMB2_MAX_INTERIM_RESPONSES || Now - Since > SMB2_ANSWER_TIME_LIMIT_US) {
+      Smb2Log(DIAG_ALWAYS,
+              "Function: %s, Line no.: = %d, No final answer after %d interim answers or "
+              "notifications!\n",
+              "SMB2ReadVerifyHeader", __LINE__, Skipped);
+      return NwErrno::ETIMEDOUT_;
+    }
+    Smb2Log(DIAG_VERBOSE, "Interim response, waiting for the final one\n");
+    if (SMB2DrainBytes(SockFd, SMB2BodyLength(Received), Details) != SMB2_NT_SUCCESS) {
+      return -1;
+    }
+    Rx = SMB2ReceiveAll(SockFd, Buffer, SMB2_FRAMED_HEADER_SIZE, Details, BytesRead);
+  }
+  return Rx;
+}
+
+// A header that does not belong to this exchange where it stands in the
+// stream: after it, the stream's framing cannot be trusted.
+bool OutOfStep(const SMB2_HEADER *Header, const TRANSACT_DETAILS *Details, UINT16 Command) {
+  const CHAR8 *Why = nullptr;
+  UINT32 Stream = SMB2StreamLength(Header);
+  // A continuation answer is taken whatever its protocol id and message id
+  // (the session setup checks its message id itself).
+  bool Continuation = Header->Status == STATUS_MORE_PROCESSING_REQUIRED;
+  if (!Continuation && CompareMem(Header->ProtocolId, kProtocolId, sizeof(kProtocolId)) != 0) {
+    Why = "ProtocolId";
+  } else if (Header->StructureSize != SMB2_HEADER_STRUCTURE_SIZE) {
+    Why = "StructureSize";
+  } else if (Stream < SMB2_HEADER_STRUCTURE_SIZE || Stream > SMB2_MAX_STREAM_LENGTH) {
+    Why = "StreamProtocolLength";
+  } else if (!Continuation && Header->MessageId != Details->MessageId) {
+    Why = "MessageId";
+  } else if (Header->Command != Command) {
+    Why = "Command";
+  }
+  if (Why == nullptr) {
+    return false;
+  }
+  Smb2Log(DIAG_ALWAYS,
+          "Function: %s, Line no.: = %d, Answer out of step: its %s does not fit the request "
+          "(command 0x%x, message id 0x%lx)!\n",
+          "SMB2ReadVerifyHeader", __LINE__, Why, Command, Details->MessageId);
+  return true;
+}
+
 } // namespace
 
 EFI_STATUS SMB2ReadVerifyHeader(SMB2_HEADER *Header, TRANSACT_DETAILS *Details, INT32 SockFd,
-                                UINT32 *NtStatus) {
+                                UINT32 *NtStatus, UINT16 Command) {
   UINT32 LocalNt;
   if (NtStatus == nullptr) {
     NtStatus = &LocalNt;
@@ -237,54 +305,33 @@ EFI_STATUS SMB2ReadVerifyHeader(SMB2_HEADER *Header, TRANSACT_DETAILS *Details, 
     DiagNullInput();
     return EFI_INVALID_PARAMETER;
   }
-  UINT8 *Buffer = static_cast<UINT8 *>(AllocateZeroPool(SMB2_FRAMED_HEADER_SIZE + 1));
-  if (Buffer == nullptr) {
-    Smb2Log(DIAG_ALWAYS, "Memory allocation failed!\n");
-    return EFI_OUT_OF_RESOURCES;
-  }
+  UINT8 Buffer[SMB2_FRAMED_HEADER_SIZE + 1] = {};
   SMB2_HEADER *Received = reinterpret_cast<SMB2_HEADER *>(Buffer);
   INT64 BytesRead = 0;
-  INT32 Rx = SMB2ReceiveAll(SockFd, Buffer, SMB2_FRAMED_HEADER_SIZE, Details, &BytesRead);
-  for (UINT32 Interim = 0;
-       Rx == 0 && IsInterimResponse(Received) && Interim < SMB2_MAX_INTERIM_RESPONSES; Interim++) {
-    Smb2Log(DIAG_VERBOSE, "Interim response, waiting for the final one\n");
-    if (SMB2DrainBytes(SockFd, SMB2BodyLength(Received), Details) != SMB2_NT_SUCCESS) {
-      Rx = -1;
-      break;
-    }
-    Rx = SMB2ReceiveAll(SockFd, Buffer, SMB2_FRAMED_HEADER_SIZE, Details, &BytesRead);
-  }
-  *NtStatus = static_cast<UINT32>(Rx);
-  EFI_STATUS Status;
+  INT32 Rx = ReceiveFinalHeader(Buffer, Details, SockFd, &BytesRead);
   if (Rx != 0) {
+    // What arrived of a frame that broke off says nothing trustworthy: the
+    // connection is given up, nothing more is read.
     Smb2Log(DIAG_ALWAYS, "%s (%d): Error in receiving the data! Status = %d, BytesRead = %lld\n",
             "SMB2ReadVerifyHeader", __LINE__, Rx, BytesRead);
-    if (BytesRead >= static_cast<INT64>(SMB2_STREAM_PREFIX_SIZE)) {
-      UINT64 Whole = static_cast<UINT64>(SMB2StreamLength(Received)) + SMB2_STREAM_PREFIX_SIZE;
-      if (Whole > static_cast<UINT64>(BytesRead)) {
-        UINT32 Drain = SMB2DrainBytes(SockFd, Whole - static_cast<UINT64>(BytesRead), Details);
-        Smb2Log(DIAG_ALWAYS,
-                "%s (%d): Error in receiving the data! Status = %d, BytesRead = %lld\n",
-                "SMB2ReadVerifyHeader", __LINE__, Drain, BytesRead);
-      }
-    }
-    *NtStatus = STATUS_UNSUCCESSFUL;
-    Status = EFI_PROTOCOL_ERROR;
-  } else {
-    Smb2Log(DIAG_VERBOSE, "Received all header bytes!\n");
-    Status = SMB2VerifyHeader(Received, Details);
-    if (EFI_ERROR(Status)) {
-      DiagError("SMB2VerifyHeader failed!", Status);
-      DumpHeaderBytes(Buffer, SMB2_FRAMED_HEADER_SIZE);
-      SMB2DrainRefused(SockFd, Received, 0, Details);
-      *NtStatus = STATUS_UNSUCCESSFUL;
-    } else {
-      CopyMem(Header, Buffer, SMB2_FRAMED_HEADER_SIZE);
-      *NtStatus = SMB2_NT_SUCCESS;
-    }
+    return EFI_PROTOCOL_ERROR;
   }
-  FreePool(Buffer);
-  return Status;
+  Smb2Log(DIAG_VERBOSE, "Received all header bytes!\n");
+  EFI_STATUS Status = SMB2VerifyHeader(Received, Details);
+  if (EFI_ERROR(Status)) {
+    DiagError("SMB2VerifyHeader failed!", Status);
+    DumpHeaderBytes(Buffer, SMB2_FRAMED_HEADER_SIZE);
+  }
+  if (OutOfStep(Received, Details, Command)) {
+    return EFI_COMPROMISED_DATA;
+  }
+  if (EFI_ERROR(Status)) {
+    SMB2DrainRefused(SockFd, Received, 0, Details);
+    return Status;
+  }
+  CopyMem(Header, Buffer, SMB2_FRAMED_HEADER_SIZE);
+  *NtStatus = SMB2_NT_SUCCESS;
+  return EFI_SUCCESS;
 }
 
 void SMB2PrintAllocFailure(const CHAR8 *Function, UINT32 Line) {

@@ -106,9 +106,12 @@ constexpr UINT32 SMB2_STREAM_PREFIX_SIZE = 4;
 constexpr UINT32 SMB2_MAX_STREAM_LENGTH = 0x00FFFFFF;
 constexpr UINT32 SMB2_MAX_BUFFERED_BODY = 0x10000;
 // A server that takes its time with a request first sends interim answers
-// (STATUS_PENDING); the header read quietly skips at most this many before
-// the final answer on the same message id.
+// (STATUS_PENDING), and may send unsolicited notifications at any time; the
+// header read quietly skips at most this many of them, and waits for the
+// final answer no longer than the answer time limit after the first one.
 constexpr UINT32 SMB2_MAX_INTERIM_RESPONSES = 16;
+constexpr UINT64 SMB2_ANSWER_TIME_LIMIT_US = 10000000;
+constexpr UINT64 SMB2_NOTIFICATION_MESSAGE_ID = 0xFFFFFFFFFFFFFFFFULL;
 
 // ---------------------------------------------------------------------------
 // The connection record
@@ -245,12 +248,21 @@ UINT32 SMB2SendAll(INT32 SockFd, const UINT8 *Bytes, UINT64 Length, UINT32 *Tran
 // Reading responses
 // ---------------------------------------------------------------------------
 EFI_STATUS SMB2VerifyHeader(const SMB2_HEADER *Header, TRANSACT_DETAILS *Details);
-// Reads exactly the 68 header bytes (skipping interim answers), checks them
-// and copies them out. A
-// refused header has the rest of its message consumed so that the next
-// exchange starts on a message boundary.
+// Reads exactly the 68 header bytes of the answer to the request now
+// outstanding (Details->MessageId, Command) and checks them. On the way it
+// skips, a bounded number of times and within the answer time limit, interim
+// answers (STATUS_PENDING on the same message id) and unsolicited
+// notifications (message id 0xFFFFFFFFFFFFFFFF). Results:
+//   EFI_SUCCESS             the header, copied out;
+//   EFI_PROTOCOL_ERROR      it did not arrive (failed or short receive);
+//   EFI_COMPROMISED_DATA    it arrived but puts the stream out of step (no
+//                           protocol id, wrong structure size, stream length,
+//                           message id or command): nothing more of it is read;
+//   another error           the header check refused it (an error status); the
+//                           rest of its message is consumed so that the next
+//                           exchange starts on a message boundary.
 EFI_STATUS SMB2ReadVerifyHeader(SMB2_HEADER *Header, TRANSACT_DETAILS *Details, INT32 SockFd,
-                                UINT32 *NtStatus);
+                                UINT32 *NtStatus, UINT16 Command);
 // Receives exactly Length bytes (the read-all operation with the standard
 // loop limit), recording the transport status in the record. Returns the
 // transport result; *Received gets the byte count.

@@ -148,6 +148,17 @@ EFI_STATUS SMB2VerifyExtractNegotiateResponse(const SMB2_NEGOTIATE_RESPONSE *Res
             Details->SecurityMode, Response->SecurityMode);
     Details->SecurityMode = static_cast<UINT8>(Response->SecurityMode);
   }
+  // A server must be able to carry file data: transfers shrink to smaller
+  // maximum sizes, but one too small for any useful transfer is refused.
+  if (Response->MaxReadSize < SMB2_MIN_TRANSFER_SIZE ||
+      Response->MaxWriteSize < SMB2_MIN_TRANSFER_SIZE) {
+    Smb2Log(DIAG_ALWAYS,
+            "Function: %s, Line no.: = %d, MaxReadSize 0x%x or MaxWriteSize 0x%x is below the "
+            "0x%x bytes a transfer needs!\n",
+            __func__, __LINE__, Response->MaxReadSize, Response->MaxWriteSize,
+            SMB2_MIN_TRANSFER_SIZE);
+    return EFI_PROTOCOL_ERROR;
+  }
   Details->MaxTransactSize = Response->MaxTransactSize;
   Details->MaxReadSize = Response->MaxReadSize;
   Details->MaxWriteSize = Response->MaxWriteSize;

@@ -57,6 +57,9 @@ static_assert(offsetof(SMB2_NEGOTIATE_RESPONSE, ServerStartTime) == 116, "Server
 static_assert(offsetof(SMB2_NEGOTIATE_RESPONSE, SecurityBufferOffset) == 124, "SecBuf offset");
 static_assert(offsetof(SMB2_NEGOTIATE_RESPONSE, SecurityBufferLength) == 126, "SecBuf length");
 
+// The least MaxReadSize and MaxWriteSize a server may announce.
+constexpr UINT32 SMB2_MIN_TRANSFER_SIZE = 4096;
+
 // {FCB1A629-F177-4738-A677-37A3CB048EBA}, the same on every connect.
 constexpr UINT8 SMB2_CLIENT_GUID[16] = {0x29, 0xA6, 0xB1, 0xFC, 0x77, 0xF1, 0x38, 0x47,
                                         0xA6, 0x77, 0x37, 0xA3, 0xCB, 0x04, 0x8E, 0xBA};

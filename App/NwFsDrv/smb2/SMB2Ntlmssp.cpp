@@ -53,6 +53,27 @@ EFI_STATUS AvPairFind(const TRANSACT_DETAILS *Details, UINT16 Wanted, UINT16 Req
   return EFI_NOT_FOUND;
 }
 
+// The AV pairs of a target info of Length bytes: every pair's 4-byte header
+// and its value lie within it, up to the end-of-list pair (or the end).
+bool AvPairsWithin(const UINT8 *Info, UINT64 Length) {
+  UINT64 At = 0;
+  while (At < Length) {
+    if (Length - At < 4 || SMB2ReadLe16(Info + At + 2) > Length - At - 4) {
+      Smb2Log(DIAG_ALWAYS,
+              "Function: %s, Line no.: = %d, Target info AV pair at %ld runs past the %ld bytes "
+              "of the target info!\n",
+              "SMB2NTLMExtractChallenge", __LINE__, static_cast<INT64>(At),
+              static_cast<INT64>(Length));
+      return false;
+    }
+    if (SMB2ReadLe16(Info + At) == MSV_AV_EOL) {
+      return true;
+    }
+    At += 4 + SMB2ReadLe16(Info + At + 2);
+  }
+  return true;
+}
+
 void LayField(NTLMSSP_FIELD *Field, UINT32 Length, UINT32 Offset) {
   Field->Len = static_cast<UINT16>(Length);
   Field->MaxLen = static_cast<UINT16>(Length);
@@ -297,6 +318,11 @@ EFI_STATUS SMB2NTLMExtractChallenge(const SMB2_NTLM_CHALLENGE *Challenge,
   bool NameEndUsable =
       NameEnd >= sizeof(SMB2_NTLMSSP_CHALLENGE_MESSAGE) && NameEnd + InfoLength <= Length;
   Details->ChallAttributes = NameEndUsable ? Msg + NameEnd : Details->ChallResponse;
+  // Every pair the walks may meet must lie within the target info.
+  if (!AvPairsWithin(Details->ChallAttributes, InfoLength) ||
+      !AvPairsWithin(Details->ChallResponse, InfoLength)) {
+    return EFI_PROTOCOL_ERROR;
+  }
   return ChooseDomain(Challenge, NameLength, Details);
 }
 

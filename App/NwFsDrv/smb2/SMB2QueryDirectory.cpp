@@ -3,7 +3,8 @@
 // answer into directory nodes.
 //
 // The walk trusts nothing in the answer: every entry's fixed part and name
-// must lie inside the answer, a name must fit inside its own entry, and
+// must lie inside the answer, a name (UTF-16, so an even number of bytes)
+// must fit inside its own entry, and
 // NextEntryOffset must lead forward past the current entry to a point
 // inside the answer. Offsets are summed in 64 bits, so no value can wrap
 // back onto an earlier entry; since each step moves forward by at least one
@@ -41,6 +42,11 @@ EFI_STATUS CheckEntry(const UINT8 *Base, UINT64 Length, UINT64 Offset, UINT32 *N
     Smb2Log(DIAG_ALWAYS, "Error! FileNameLength %d is greater than limited %d length\n", NameLength,
             kNameLimit);
     return EFI_SECURITY_VIOLATION;
+  }
+  if (NameLength % 2 != 0) {
+    Smb2Log(DIAG_ALWAYS, "Error! FileNameLength %u of the entry at offset %ld is odd\n", NameLength,
+            static_cast<INT64>(Offset));
+    return EFI_PROTOCOL_ERROR;
   }
   UINT64 EntryRoom = *Next != 0 ? *Next : Length - Offset;
   if (SMB2_FULL_DIR_NAME + static_cast<UINT64>(NameLength) > EntryRoom ||
@@ -103,7 +109,7 @@ const SMB2_COMMAND gSMB2QueryDirectoryCommand = {
     SMB2_QUERY_DIRECTORY,
     0,
     sizeof(SMB2_QUERY_RESPONSE_BODY),
-    SMB2_QUERY_DIRECTORY_OUTPUT_LENGTH,
+    SMB2_QUERY_DIRECTORY_OUTPUT_LENGTH + SMB2_QUERY_OUTPUT_PADDING,
     "SMB2QueryDirInfoRequest",
     "SMB2QueryDirInfoResponse",
     "Query Directory request send failed!",

@@ -92,7 +92,7 @@ const SMB2_COMMAND gSMB2QueryInfoCommand = {
     SMB2_QUERY_INFO,
     0,
     sizeof(SMB2_QUERY_RESPONSE_BODY),
-    SMB2_QUERY_INFO_OUTPUT_LENGTH,
+    SMB2_QUERY_INFO_OUTPUT_LENGTH + SMB2_QUERY_OUTPUT_PADDING,
     "SMB2QueryInfoRequest",
     "SMB2QueryInfoResponse",
     "Query Info request send failed!",
@@ -174,18 +174,25 @@ UINT32 SMB2DecodeQueryAnswer(void *Context, const SMB2_RESPONSE *Answer) {
     Smb2Log(DIAG_ALWAYS, "%s", Texts.Empty);
     return SMB2_NT_SUCCESS;
   }
-  // The output is taken to follow the fixed body directly.
+  // The output lies at OutputBufferOffset (from the SMB2 header), at or
+  // after the end of the fixed body and within what arrived.
   UINT64 Announced = Answer->BodyLength - Answer->FixedLength;
-  if (Length > Announced || Length > Texts.Limit || Length > Answer->VariableLength) {
+  if (Length > Announced || Length > Texts.Limit) {
     Smb2Log(DIAG_ALWAYS,
             "Function: %s, Line no.: = %d, OutputBufferLength %u is beyond the %ld bytes that "
             "follow or the %u bytes asked for!\n",
             Texts.Function, __LINE__, Length, static_cast<INT64>(Announced), Texts.Limit);
     return STATUS_UNSUCCESSFUL;
   }
+  const UINT8 *Output = SMB2ResponseRange(Answer, Packet.Body.OutputBufferOffset, Length);
+  if (Output == nullptr) {
+    Smb2Log(DIAG_ALWAYS,
+            "Function: %s, Line no.: = %d, OutputBufferOffset 0x%x lies outside the response!\n",
+            Texts.Function, __LINE__, Packet.Body.OutputBufferOffset);
+    return STATUS_UNSUCCESSFUL;
+  }
   UINT32 Code = SMB2_NT_SUCCESS;
-  EFI_STATUS Status =
-      SMB2VerifyInfoStructure(&Packet, const_cast<UINT8 *>(Answer->Variable), Query, Access);
+  EFI_STATUS Status = SMB2VerifyInfoStructure(&Packet, const_cast<UINT8 *>(Output), Query, Access);
   if (Status == EFI_SECURITY_VIOLATION) {
     DiagError(Texts.LogonFailed, Status, Texts.Function, __LINE__);
     Code = STATUS_LOGON_FAILURE;

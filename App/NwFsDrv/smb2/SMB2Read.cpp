@@ -2,9 +2,9 @@
 // decoder.
 //
 // Read data is received straight into the caller's buffer, and never more
-// than the request's Length: a DataLength beyond what was asked for, or
-// beyond what the answer announces, is refused before a byte of data is
-// taken.
+// than the request's Length: a DataOffset inside the fixed body, or data
+// beyond what was asked for or beyond what the answer announces, is refused
+// before a byte of data is taken.
 #include "DiagLog.h"
 #include "NwBaseLib.h"
 #include "smb2/SMB2FileAccess.h"
@@ -28,29 +28,38 @@ UINT32 EncodeRead(void *Context, TRANSACT_DETAILS *Details, SMB2_REQUEST *Reques
   return SMB2_NT_SUCCESS;
 }
 
-// The data is taken to follow the fixed body directly (DataOffset is not
-// consulted); it must fit both what the answer announces and what was asked
-// for.
+// The data lies at DataOffset (from the SMB2 header), which must be at or
+// after the end of the fixed body; it must fit both what the answer holds
+// and what was asked for.
 UINT32 PlaceReadData(void *Context, const SMB2_RESPONSE *Answer, SMB2_PLACEMENT *Placement) {
   SMB2_FILE_CONTEXT *File = static_cast<SMB2_FILE_CONTEXT *>(Context);
   SMB2_READ_RESPONSE_BODY Body;
   CopyMem(&Body, Answer->Fixed, sizeof(Body));
+  UINT64 FixedEnd = SMB2_HEADER_STRUCTURE_SIZE + Answer->FixedLength;
   UINT64 Announced = Answer->BodyLength - Answer->FixedLength;
   UINT32 Asked = File->Access->ReadWriteInfo.Length;
   Smb2Log(DIAG_VERBOSE, "DataLength = %d, DataRemaining = %d\n", Body.DataLength,
           Body.DataRemaining);
-  if (Body.DataLength > Announced || Body.DataLength > Asked) {
-    Smb2Log(DIAG_ALWAYS,
-            "Function: %s, Line no.: = %d, DataLength %u is beyond the %ld bytes that follow or "
-            "the %u bytes asked for!\n",
-            "SMB2ReadResponse", __LINE__, Body.DataLength, static_cast<INT64>(Announced), Asked);
-    return STATUS_UNSUCCESSFUL;
-  }
   if (Body.DataLength == 0) {
     Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, No file data to read\n", "SMB2ReadResponse",
             __LINE__);
     return SMB2_NT_SUCCESS;
   }
+  if (Body.DataOffset < FixedEnd || Body.DataOffset - FixedEnd + Body.DataLength > Announced) {
+    Smb2Log(DIAG_ALWAYS,
+            "Function: %s, Line no.: = %d, DataOffset 0x%x and DataLength %u lie outside the %ld "
+            "bytes that follow!\n",
+            "SMB2ReadResponse", __LINE__, Body.DataOffset, Body.DataLength,
+            static_cast<INT64>(Announced));
+    return STATUS_UNSUCCESSFUL;
+  }
+  if (Body.DataLength > Asked) {
+    Smb2Log(DIAG_ALWAYS,
+            "Function: %s, Line no.: = %d, DataLength %u is beyond the %u bytes asked for!\n",
+            "SMB2ReadResponse", __LINE__, Body.DataLength, Asked);
+    return STATUS_UNSUCCESSFUL;
+  }
+  Placement->Skip = static_cast<UINT32>(Body.DataOffset - FixedEnd);
   Placement->Destination = File->Data;
   Placement->Length = Body.DataLength;
   return SMB2_NT_SUCCESS;

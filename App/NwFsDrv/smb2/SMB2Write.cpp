@@ -23,13 +23,21 @@ UINT32 EncodeWrite(void *Context, TRANSACT_DETAILS *Details, SMB2_REQUEST *Reque
   return SMB2_NT_SUCCESS;
 }
 
-// Count is not compared with what was sent: a complete answer with a good
-// header is success, and everything sent counts as written.
+// Count says how much of what was sent the server wrote: all of it, or a
+// part (a short write, which the caller continues). None, or more than was
+// sent, is no answer to this request.
 UINT32 DecodeWrite(void *Context, const SMB2_RESPONSE *Answer) {
-  (void)Answer;
   SMB2_FILE_CONTEXT *File = static_cast<SMB2_FILE_CONTEXT *>(Context);
+  SMB2_WRITE_RESPONSE_BODY Body;
+  CopyMem(&Body, Answer->Fixed, sizeof(Body));
+  UINT32 Sent = File->Packet.Write.Length;
   SMB2_READ_WRITE_INFO &Rw = File->Access->ReadWriteInfo;
-  Rw.BytesWritten = File->Packet.Write.Length;
+  if (Body.Count > Sent || (Body.Count == 0 && Sent != 0)) {
+    Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, Count %u answers a WRITE of %u bytes!\n",
+            "SMB2WriteResponse", __LINE__, Body.Count, Sent);
+    return STATUS_UNSUCCESSFUL;
+  }
+  Rw.BytesWritten = Body.Count;
   Smb2Log(DIAG_VERBOSE, "Bytes written = %ld\n", static_cast<INT64>(Rw.BytesWritten));
   return SMB2_NT_SUCCESS;
 }
