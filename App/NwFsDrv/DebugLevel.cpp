@@ -8,10 +8,10 @@ UINT8 gDriverDebugLevel = 5;
 UINT8 gSMB2DebugLevel = 0;
 UINT8 gTcpDebugLevel = 0;
 
-namespace {
-
 const EFI_GUID gDebugLevelVariableGuid = {
     0x47C7B224, 0xC42A, 0x11D2, {0x8E, 0x57, 0x00, 0xA0, 0xC9, 0x69, 0x72, 0x3B}};
+
+namespace {
 
 constexpr UINTN LevelDataSize = 6;
 constexpr INT64 DriverLevelMax = 5;

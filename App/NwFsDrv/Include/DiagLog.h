@@ -74,6 +74,10 @@ void DiagShortExit(EFI_STATUS Status, CHAR8 Separator = ',',
 // a "main (221): " built by the caller.
 void DiagGuid(UINT8 Threshold, const CHAR8 *Prefix, const EFI_GUID &Guid);
 
+// The vendor GUID of the debug-level variables (and of the client's other
+// settings, such as "SMB2Signing").
+extern const EFI_GUID gDebugLevelVariableGuid;
+
 // The two level initialisers, reading their UEFI variables.
 EFI_STATUS QVUIkestDebugLevelInitialize(UINT8 *DebugLevel);
 EFI_STATUS SMB2DebugLevelInitialize(UINT8 *DebugLevel);

@@ -12,6 +12,7 @@
 #include "NwBaseLib.h"
 #include "smb2/SMB2Negotiate.h"
 #include "smb2/SMB2Session.h"
+#include "smb2/SMB2Signing.h"
 #include "smb2/TcpTransport.h"
 
 namespace {
@@ -254,6 +255,7 @@ EFI_STATUS SMB2_Connect(SMB2ConnectInfo *ConnectInfo, SMB2ShareDetails *Share) {
   ZeroMem(&TransactDetails, sizeof(TransactDetails));
   SMB2ConnectionState = SMB2_STATE_CLOSED;
   SMB2ResetConnectionHealth();
+  SMB2SigningReset();
   if (ConnectInfo == nullptr || Share == nullptr) {
     DiagNullInput();
     return EFI_INVALID_PARAMETER;
@@ -336,6 +338,8 @@ EFI_STATUS SMB2_Disconnect(SMB2ConnectInfo *ConnectInfo, SMB2ShareDetails *Share
   // released with the connection so that a finished run holds no pool.
   FreePool(TransactDetails.ChallResponse);
   TransactDetails.ChallResponse = nullptr;
+  // The session key goes with the session.
+  SMB2SigningReset();
   DiagExit(Status, DiagChannel::Smb2);
   return Status;
 }

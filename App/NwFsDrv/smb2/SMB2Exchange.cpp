@@ -9,6 +9,7 @@
 #include "DiagLog.h"
 #include "NwBaseLib.h"
 #include "NwPlatform.h"
+#include "smb2/SMB2Signing.h"
 
 SMB2_REQUEST_TRACE gSMB2RequestTrace[SMB2_REQUEST_TRACE_SLOTS];
 UINT64 gSMB2RequestCount;
@@ -83,6 +84,9 @@ UINT32 SendRequest(const SMB2_COMMAND *Command, void *Context) {
   SMB2_HEADER *Header = reinterpret_cast<SMB2_HEADER *>(Buffer);
   SMB2HeaderFill(Header, Command->Command, Request.Total, &TransactDetails, Request.DataLength);
   TraceRequest(Header, Request);
+  if (SMB2SigningActive() && Command->Command != SMB2_SESSION_SETUP) {
+    SMB2SignRequest(Buffer, Request.Total);
+  }
   Code = SMB2SendAll(gSMB2SockFd, Buffer, Request.Total, &TransactDetails.TransportStatus);
   // A session setup carries the authentication blob: nothing of a request
   // stays behind in the pool.
@@ -106,7 +110,8 @@ UINT32 SendRequest(const SMB2_COMMAND *Command, void *Context) {
 // The bytes of one answer's frame that are still to come.
 struct FRAME_READER {
   UINT64 Left;
-  bool Failed; // a read of the frame failed
+  bool Failed;                 // a read of the frame failed
+  SMB2_SIGNATURE_CHECK *Check; // the frame's signature, when answers are verified
 };
 
 // Reads exactly Length bytes of the frame into Destination.
@@ -122,6 +127,9 @@ INT32 FrameRead(FRAME_READER *Frame, void *Destination, UINT64 Length, UINT64 *G
   UINT64 Taken = Received > 0 ? static_cast<UINT64>(Received) : 0;
   Frame->Left -= Taken < Frame->Left ? Taken : Frame->Left;
   Frame->Failed = Frame->Failed || Rx != 0;
+  if (Frame->Check != nullptr) {
+    SMB2SignatureUpdate(Frame->Check, Destination, Taken);
+  }
   if (Got != nullptr) {
     *Got = Taken;
   }
@@ -211,6 +219,23 @@ UINT32 ReadVariablePart(const SMB2_COMMAND *Command, void *Context, FRAME_READER
   return Rx == 0 ? SMB2_NT_SUCCESS : BodyFailure(Command, Rx);
 }
 
+// Reads what follows the header of an accepted answer: the fixed body and
+// the variable part.
+UINT32 ReadBody(const SMB2_COMMAND *Command, void *Context, FRAME_READER *Frame,
+                SMB2_RESPONSE *Response, UINT8 **Kept) {
+  if (Response->BodyLength < Command->FixedSize) {
+    Smb2Log(DIAG_ALWAYS,
+            "Function: %s, Line no.: = %d, Response body of %u bytes is shorter than its fixed "
+            "part of %u bytes!\n",
+            Command->ResponseName, __LINE__, Response->BodyLength, Command->FixedSize);
+    return STATUS_UNSUCCESSFUL;
+  }
+  INT32 Rx = FrameRead(Frame, Response->Fixed, Command->FixedSize);
+  Response->FixedLength = Command->FixedSize;
+  return Rx == 0 ? ReadVariablePart(Command, Context, Frame, Response, Kept)
+                 : BodyFailure(Command, Rx);
+}
+
 // Reads, checks and decodes the answer of the request just sent.
 UINT32 ReceiveAnswer(const SMB2_COMMAND *Command, void *Context) {
   SMB2_RESPONSE Response;
@@ -218,42 +243,46 @@ UINT32 ReceiveAnswer(const SMB2_COMMAND *Command, void *Context) {
   UINT32 Nt = STATUS_UNSUCCESSFUL;
   EFI_STATUS Status =
       SMB2ReadVerifyHeader(&Response.Header, &TransactDetails, gSMB2SockFd, &Nt, Command->Command);
-  if (EFI_ERROR(Status)) {
+  if (Status == EFI_PROTOCOL_ERROR || Status == EFI_COMPROMISED_DATA) {
     ReportHeaderFailure(Command, Status);
-    if (Status == EFI_PROTOCOL_ERROR || Status == EFI_COMPROMISED_DATA) {
-      MarkBroken(STATUS_UNSUCCESSFUL);
-    }
+    MarkBroken(STATUS_UNSUCCESSFUL);
     return STATUS_UNSUCCESSFUL;
   }
+  // The answer belongs to this request; all of its frame is read, through
+  // its signature when answers are verified.
+  SMB2_SIGNATURE_CHECK Check;
   Response.BodyLength = SMB2BodyLength(&Response.Header);
-  FRAME_READER Frame = {Response.BodyLength, false};
+  FRAME_READER Frame = {Response.BodyLength, false, nullptr};
+  if (SMB2SigningActive()) {
+    SMB2SignatureBegin(&Check, &Response.Header);
+    Frame.Check = &Check;
+  }
   UINT8 *Kept = nullptr;
-  UINT32 Code = SMB2_NT_SUCCESS;
-  if (Response.BodyLength < Command->FixedSize) {
-    Smb2Log(DIAG_ALWAYS,
-            "Function: %s, Line no.: = %d, Response body of %u bytes is shorter than its fixed "
-            "part of %u bytes!\n",
-            Command->ResponseName, __LINE__, Response.BodyLength, Command->FixedSize);
-    Code = STATUS_UNSUCCESSFUL;
+  UINT32 Code = STATUS_UNSUCCESSFUL;
+  if (EFI_ERROR(Status)) {
+    ReportHeaderFailure(Command, Status);
   } else {
-    INT32 Rx = FrameRead(&Frame, Response.Fixed, Command->FixedSize);
-    Response.FixedLength = Command->FixedSize;
-    Code = Rx == 0 ? ReadVariablePart(Command, Context, &Frame, &Response, &Kept)
-                   : BodyFailure(Command, Rx);
+    Code = ReadBody(Command, Context, &Frame, &Response, &Kept);
   }
   // Whatever the frame holds beyond what was taken is consumed, so that the
   // next exchange starts on a message boundary; a frame that cannot be
   // consumed fails the exchange. After a transport failure nothing more is
-  // read: the transport status of that failure stands.
-  UINT64 Rest = Frame.Left;
-  if (Rest > 0 && !Frame.Failed) {
-    Smb2Log(DIAG_VERBOSE, "Reading pending bytes %ld\n", static_cast<INT64>(Rest));
-    INT32 Rx = FrameSkip(&Frame, Rest);
+  // read: the transport status of that failure stands, and the connection
+  // is given up.
+  if (Frame.Left > 0 && !Frame.Failed) {
+    Smb2Log(DIAG_VERBOSE, "Reading pending bytes %ld\n", static_cast<INT64>(Frame.Left));
+    INT32 Rx = FrameSkip(&Frame, Frame.Left);
     if (Rx != 0 && Code == SMB2_NT_SUCCESS) {
       Code = BodyFailure(Command, Rx);
     }
   }
   if (Frame.Failed) {
+    MarkBroken(Code);
+  }
+  if (Frame.Check != nullptr && !SMB2SignatureMatches(&Check) && !Frame.Failed) {
+    DiagError("The answer's signature is missing or wrong!", EFI_SECURITY_VIOLATION,
+              Command->ResponseName, __LINE__);
+    Code = STATUS_INVALID_SIGNATURE;
     MarkBroken(Code);
   }
   if (Code == SMB2_NT_SUCCESS) {

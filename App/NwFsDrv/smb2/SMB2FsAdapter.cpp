@@ -3,6 +3,7 @@
 
 #include "DiagLog.h"
 #include "NwBaseLib.h"
+#include "smb2/SMB2Signing.h"
 #include "smb2/TcpTransport.h"
 
 const NW_BACKEND gSMB2FsBackend = {
@@ -336,6 +337,7 @@ EFI_STATUS SMB2_FSResetState() {
   ZeroMem(&TransactDetails, sizeof(TransactDetails));
   SMB2ConnectionState = SMB2_STATE_CLOSED;
   SMB2ResetConnectionHealth();
+  SMB2SigningReset();
   gSMB2AdapterState = 0;
   return EFI_SUCCESS;
 }

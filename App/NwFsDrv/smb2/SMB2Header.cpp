@@ -207,19 +207,6 @@ UINT32 SMB2DrainBytes(INT32 SockFd, UINT64 Length, TRANSACT_DETAILS *Details, UI
   return Status;
 }
 
-UINT32 SMB2DrainRefused(INT32 SockFd, const SMB2_HEADER *Header, UINT32 BodyBytesRead,
-                        TRANSACT_DETAILS *Details, UINT64 *Drained) {
-  if (Drained != nullptr) {
-    *Drained = 0;
-  }
-  UINT32 Body = SMB2BodyLength(Header);
-  if (CompareMem(Header->ProtocolId, kProtocolId, sizeof(kProtocolId)) != 0 ||
-      Body <= BodyBytesRead) {
-    return SMB2_NT_SUCCESS;
-  }
-  return SMB2DrainBytes(SockFd, Body - BodyBytesRead, Details, Drained);
-}
-
 namespace {
 
 // Answers the header read passes over on its way to the final one: interim
@@ -325,13 +312,9 @@ EFI_STATUS SMB2ReadVerifyHeader(SMB2_HEADER *Header, TRANSACT_DETAILS *Details, 
   if (OutOfStep(Received, Details, Command)) {
     return EFI_COMPROMISED_DATA;
   }
-  if (EFI_ERROR(Status)) {
-    SMB2DrainRefused(SockFd, Received, 0, Details);
-    return Status;
-  }
   CopyMem(Header, Buffer, SMB2_FRAMED_HEADER_SIZE);
-  *NtStatus = SMB2_NT_SUCCESS;
-  return EFI_SUCCESS;
+  *NtStatus = EFI_ERROR(Status) ? STATUS_UNSUCCESSFUL : SMB2_NT_SUCCESS;
+  return Status;
 }
 
 void SMB2PrintAllocFailure(const CHAR8 *Function, UINT32 Line) {
@@ -352,8 +335,9 @@ EFI_STATUS SMB2MapNtStatus(UINT32 NtStatus, const CHAR8 *Callee, const CHAR8 *Fu
     Ending = "returned invalid parameter!";
     Status = EFI_INVALID_PARAMETER;
   } else {
+    // A missing or wrong signature stays a security violation.
     Ending = "returned error!";
-    Status = EFI_DEVICE_ERROR;
+    Status = NtStatus == STATUS_INVALID_SIGNATURE ? EFI_SECURITY_VIOLATION : EFI_DEVICE_ERROR;
   }
   Smb2Log(DIAG_ALWAYS, "Function: %s, Line no.: = %d, %s %s Status = 0x%lx\n", Function, Line,
           Callee, Ending, static_cast<UINT64>(NtStatus));

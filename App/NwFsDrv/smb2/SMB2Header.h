@@ -24,6 +24,7 @@ constexpr UINT32 STATUS_MORE_PROCESSING_REQUIRED = 0xC0000016;
 constexpr UINT32 STATUS_PENDING = 0x00000103;
 constexpr UINT32 STATUS_NO_MEMORY = 0xC0000017;
 constexpr UINT32 STATUS_LOGON_FAILURE = 0xC000006D;
+constexpr UINT32 STATUS_INVALID_SIGNATURE = 0xC000A000;
 constexpr UINT32 SMB2_NT_INVALID_PARAMETER = 0x80070057;
 constexpr UINT32 SMB2_NT_OUT_OF_MEMORY = 0x8007000E;
 
@@ -258,9 +259,9 @@ EFI_STATUS SMB2VerifyHeader(const SMB2_HEADER *Header, TRANSACT_DETAILS *Details
 //   EFI_COMPROMISED_DATA    it arrived but puts the stream out of step (no
 //                           protocol id, wrong structure size, stream length,
 //                           message id or command): nothing more of it is read;
-//   another error           the header check refused it (an error status); the
-//                           rest of its message is consumed so that the next
-//                           exchange starts on a message boundary.
+//   another error           the header check refused it (an error status), the
+//                           header copied out; the rest of its message is the
+//                           caller's to consume.
 EFI_STATUS SMB2ReadVerifyHeader(SMB2_HEADER *Header, TRANSACT_DETAILS *Details, INT32 SockFd,
                                 UINT32 *NtStatus, UINT16 Command);
 // Receives exactly Length bytes (the read-all operation with the standard
@@ -273,12 +274,6 @@ INT32 SMB2ReceiveAll(INT32 SockFd, void *Buffer, UINT64 Length, TRANSACT_DETAILS
 // gets the bytes consumed.
 UINT32 SMB2DrainBytes(INT32 SockFd, UINT64 Length, TRANSACT_DETAILS *Details,
                       UINT64 *Drained = nullptr);
-// Consumes the rest of a refused response (its body less BodyBytesRead) so
-// that the next exchange starts on a message boundary. A header without the
-// SMB2 protocol id says nothing trustworthy about its length; nothing is
-// read for it.
-UINT32 SMB2DrainRefused(INT32 SockFd, const SMB2_HEADER *Header, UINT32 BodyBytesRead,
-                        TRANSACT_DETAILS *Details, UINT64 *Drained = nullptr);
 // The body bytes that follow a framed header (stream length − 64), or 0 for
 // a stream shorter than a header.
 UINT32 SMB2BodyLength(const SMB2_HEADER *Header);

@@ -4,6 +4,7 @@
 
 #include "DiagLog.h"
 #include "NwBaseLib.h"
+#include "smb2/SMB2Signing.h"
 
 namespace {
 
@@ -68,7 +69,11 @@ UINT32 DecodeNegotiate(void *Context, const SMB2_RESPONSE *Answer) {
   TransactDetails.SecurityMode = static_cast<UINT8>(Offer->SecurityMode);
   TransactDetails.CreditRequest = Offer->Header.CreditRequest;
   Negotiate->Verdict = SMB2VerifyExtractNegotiateResponse(&Response, &TransactDetails);
-  return EFI_ERROR(Negotiate->Verdict) ? STATUS_UNSUCCESSFUL : SMB2_NT_SUCCESS;
+  if (EFI_ERROR(Negotiate->Verdict)) {
+    return STATUS_UNSUCCESSFUL;
+  }
+  SMB2SigningDecide(Response.SecurityMode);
+  return SMB2_NT_SUCCESS;
 }
 
 } // namespace

@@ -8,6 +8,7 @@
 
 #include "DiagLog.h"
 #include "NwBaseLib.h"
+#include "smb2/SMB2Signing.h"
 
 namespace {
 
@@ -154,26 +155,30 @@ EFI_STATUS BuildNtResponse(const SMB2_NTLM_CHALLENGE *Challenge, TRANSACT_DETAIL
   return Status;
 }
 
-// A fresh exported session key, RC4-encrypted with the session base key.
+// A fresh exported session key, and the same RC4-encrypted with the session
+// base key.
 EFI_STATUS BuildEncryptedSessionKey(const UINT8 SessionBaseKey[NTLM_SESSION_KEY_SIZE],
+                                    UINT8 Exported[NTLM_SESSION_KEY_SIZE],
                                     UINT8 Encrypted[NTLM_SESSION_KEY_SIZE]) {
-  UINT8 Exported[NTLM_SESSION_KEY_SIZE];
-  bool Random = NwRandomBytes(Exported, sizeof(Exported));
+  bool Random = NwRandomBytes(Exported, NTLM_SESSION_KEY_SIZE);
   Smb2Log(DIAG_VERBOSE, "RandomBytes status = %d\n", Random ? 1 : 0);
   if (!Random) {
     PrintAt("RandomBytes generation failed!", __func__, __LINE__);
     return EFI_OUT_OF_RESOURCES;
   }
-  EFI_STATUS Status =
-      CalcARC4Key(SessionBaseKey, NTLM_SESSION_KEY_SIZE, Exported, sizeof(Exported), Encrypted);
+  EFI_STATUS Status = CalcARC4Key(SessionBaseKey, NTLM_SESSION_KEY_SIZE, Exported,
+                                  NTLM_SESSION_KEY_SIZE, Encrypted);
   if (EFI_ERROR(Status)) {
     DiagError("CalcARC4Key returned", Status);
   }
-  ZeroMem(Exported, sizeof(Exported));
   return Status;
 }
 
 } // namespace
+
+UINT32 SMB2NTLMClientFlags() {
+  return SMB2_NTLMSSP_CLIENT_FLAGS | (SMB2SigningInUse() ? SMB2_NTLMSSP_SIGNING_FLAGS : 0);
+}
 
 EFI_STATUS SMB2NTLMSSPNegotiatePacketConstruct(UINT8 *Message, UINT16 *Length) {
   if (Message == nullptr || Length == nullptr) {
@@ -185,7 +190,7 @@ EFI_STATUS SMB2NTLMSSPNegotiatePacketConstruct(UINT8 *Message, UINT16 *Length) {
       reinterpret_cast<SMB2_NTLMSSP_NEGOTIATE_MESSAGE *>(Message);
   CopyMem(Negotiate->Signature, NTLMSSP_SIGNATURE, sizeof(NTLMSSP_SIGNATURE));
   Negotiate->MessageType = NTLMSSP_NEGOTIATE_MESSAGE_TYPE;
-  Negotiate->NegotiateFlags = SMB2_NTLMSSP_CLIENT_FLAGS;
+  Negotiate->NegotiateFlags = SMB2NTLMClientFlags();
   *Length = sizeof(SMB2_NTLMSSP_NEGOTIATE_MESSAGE);
   return EFI_SUCCESS;
 }
@@ -362,8 +367,10 @@ EFI_STATUS SMB2NTLMAuthenticateBlobConstruct(const SMB2_NTLM_CHALLENGE *Challeng
   UINT8 *NtResponse = nullptr;
   UINT8 *Out = nullptr;
   UINT8 SessionBaseKey[NTLM_SESSION_KEY_SIZE];
+  UINT8 ExportedKey[NTLM_SESSION_KEY_SIZE];
   UINT8 EncryptedKey[NTLM_SESSION_KEY_SIZE];
   ZeroMem(SessionBaseKey, sizeof(SessionBaseKey));
+  ZeroMem(ExportedKey, sizeof(ExportedKey));
   ZeroMem(EncryptedKey, sizeof(EncryptedKey));
   if (Total > kMaxSecurityBlob) {
     Smb2Log(DIAG_ALWAYS,
@@ -378,7 +385,7 @@ EFI_STATUS SMB2NTLMAuthenticateBlobConstruct(const SMB2_NTLM_CHALLENGE *Challeng
     Status = BuildNtResponse(Challenge, Details, NtResponse, TargetInfo, TargetInfoLength,
                              SessionBaseKey);
     if (!EFI_ERROR(Status)) {
-      Status = BuildEncryptedSessionKey(SessionBaseKey, EncryptedKey);
+      Status = BuildEncryptedSessionKey(SessionBaseKey, ExportedKey, EncryptedKey);
     }
   }
   if (!EFI_ERROR(Status)) {
@@ -403,13 +410,21 @@ EFI_STATUS SMB2NTLMAuthenticateBlobConstruct(const SMB2_NTLM_CHALLENGE *Challeng
     CopyMem(Out + Offset, EncryptedKey, NTLM_SESSION_KEY_SIZE);
     UINT32 ServerFlags =
         SMB2ReadLe32(Challenge->Message + offsetof(SMB2_NTLMSSP_CHALLENGE_MESSAGE, NegotiateFlags));
-    Auth->NegotiateFlags = SMB2_NTLMSSP_CLIENT_FLAGS | (ServerFlags & NTLMSSP_NEGOTIATE_KEY_EXCH);
+    Auth->NegotiateFlags = (SMB2NTLMClientFlags() & ~NTLMSSP_NEGOTIATE_KEY_EXCH) |
+                           (ServerFlags & NTLMSSP_NEGOTIATE_KEY_EXCH);
+    // The session key: the exported key when key exchange was negotiated,
+    // else the session base key.
+    if (SMB2SigningInUse()) {
+      SMB2SigningStart((ServerFlags & NTLMSSP_NEGOTIATE_KEY_EXCH) != 0 ? ExportedKey
+                                                                       : SessionBaseKey);
+    }
     Smb2Log(DIAG_VERBOSE, "TotalBytes = %ld\n", static_cast<INT64>(Total));
     *Message = Out;
     *Length = static_cast<UINT16>(Total);
     Out = nullptr;
   }
   ZeroMem(SessionBaseKey, sizeof(SessionBaseKey));
+  ZeroMem(ExportedKey, sizeof(ExportedKey));
   ZeroMem(EncryptedKey, sizeof(EncryptedKey));
   FreePool(Out);
   FreePool(NtResponse);

@@ -6,6 +6,7 @@
 #include "DiagLog.h"
 #include "NwBaseLib.h"
 #include "smb2/SMB2Session.h"
+#include "smb2/SMB2Signing.h"
 
 namespace {
 
@@ -200,7 +201,10 @@ EFI_STATUS SMB2SessionSetupPacketConstruct(SMB2_SESSION_SETUP_REQUEST *Packet, U
   SMB2HeaderConstruct(&Packet->Header);
   Packet->StructureSize = SMB2_REQUEST_STRUCTURE_SIZE[SMB2_SESSION_SETUP];
   Packet->Flags = Details->Flags;
-  Packet->SecurityMode = Details->SecurityMode;
+  // A client that signs where the server does not require it asks for a
+  // session that is signed.
+  Packet->SecurityMode = static_cast<UINT8>(
+      Details->SecurityMode | (SMB2SigningInUse() ? SMB2_NEGOTIATE_SIGNING_REQUIRED : 0));
   Packet->Capabilities = Details->Capabilities;
   Packet->Channel = Details->Channel;
   Packet->SecurityBufferOffset = Details->SecurityBufferOffset;
