@@ -2,11 +2,14 @@
 //
 //   CIFSDRV_RAMFS     directory behind ramfs: (default ./ramfs, created)
 //   CIFSDRV_VARSTORE  variable store file (default ./cifsdrv-vars.txt)
+//   CIFSDRV_SMB_PORT  the port dialled for the SMB server instead of 445
+//                     (a test's misbehaving server or relay)
 //
 // The console shows exactly what the image prints; the exit code is the low
 // byte of the image's status. Pool blocks or sockets the image leaves behind
 // are reported on stderr ("cifsdrv: left behind: ...") without changing the
 // exit code, so that scripts can check every run.
+#include "HostSeams.h"
 #include "HostUefi.h"
 #include "NwPlatform.h"
 
@@ -17,6 +20,9 @@ int main(int argc, char **argv) {
   HostConfig Config;
   Config.RamfsDir = getenv("CIFSDRV_RAMFS");
   Config.VarStore = getenv("CIFSDRV_VARSTORE");
+  if (const char *Port = getenv("CIFSDRV_SMB_PORT")) {
+    HostSetConnectPortOverride(static_cast<uint16_t>(atoi(Port)));
+  }
   if (HostInitialize(Config) == nullptr) {
     fprintf(stderr, "cifsdrv: the hosted environment could not be set up\n");
     return 1;
