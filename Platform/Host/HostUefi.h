@@ -34,6 +34,10 @@ EFI_STATUS HostRunImage(int Argc, char **Argv);
 // Pool accounting: blocks handed out by AllocatePool and not yet freed.
 uint64_t HostPoolOutstanding();
 uint64_t HostPoolOutstandingBytes();
+// The most bytes outstanding at once since the environment was set up, or
+// since the last HostPoolResetPeak (which starts it at what is in use now).
+uint64_t HostPoolPeakBytes();
+void HostPoolResetPeak();
 
 // Delivers due timer notifications (also done inside every boot-services
 // call, never from a signal handler).
