@@ -43,7 +43,8 @@ void HostPoolResetPeak();
 // call, never from a signal handler).
 void HostDispatchTimers();
 
-// Variable store: reload from / flush to the file named in HostConfig.
+// Variable store: reload from / flush to the file named in HostConfig. A
+// reload drops volatile changes not yet written (which HostShutdown writes).
 void HostVariablesReload();
 void HostVariablesFlush();
 
