@@ -8,7 +8,7 @@
 # The guest reaches two servers on this machine's loopback through QEMU's
 # user network (10.0.2.2 inside the guest): the Samba test server with the
 # share "fwbench" and "python3 -m http.server" serving the same 8 MiB file.
-# The startup script runs, ROUNDS times (default 3) in turn, a mount-only
+# The startup script runs, ROUNDS times (default 5) in turn, a mount-only
 # run of the image ("m"), an import of the file into ramfs: ("I") and the
 # shell's "http" download of it into ramfs:, each between marker lines. The
 # host stamps the marker lines as they reach the serial console; a step's
@@ -17,13 +17,14 @@
 # from the RAM disk with mtools and compared byte for byte with the file.
 #
 # Prints each round, the medians and the ratio http / image copy (above 1.0:
-# the image is faster than the shell's http). Run it in a private network and
-# mount namespace when other Samba or QEMU runs share the machine.
+# the image is faster than the shell's http). FW_CONSOLE_DIR names a
+# directory to keep the console log in. Run it in a private network and mount
+# namespace when other Samba or QEMU runs share the machine.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 ROOT=$(pwd)
 BUILD_DIR=${1:-$ROOT/build/efi}
-ROUNDS=${2:-3}
+ROUNDS=${2:-5}
 # shellcheck source=tests/firmware/lib.sh
 source "$ROOT/tests/firmware/lib.sh"
 
@@ -130,6 +131,10 @@ for _ in $(seq 1 40); do
   sleep 0.05
 done
 fw_clean_log "$WORK/serial.log" >"$WORK/console.txt"
+if [ -n "${FW_CONSOLE_DIR:-}" ]; then
+  mkdir -p "$FW_CONSOLE_DIR"
+  cp "$WORK/console.txt" "$WORK/stamps.txt" "$FW_CONSOLE_DIR/"
+fi
 if ! grep -q "@@DONE" "$WORK/stamps.txt"; then
   KEEP_WORK=1
   fw_die "the startup script did not finish; console at $WORK/console.txt"
