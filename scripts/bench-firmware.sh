@@ -9,7 +9,7 @@
 # user network (10.0.2.2 inside the guest): the Samba test server with the
 # share "fwbench" and "python3 -m http.server" serving the same 8 MiB file.
 # The startup script runs, ROUNDS times (default 5) in turn, a mount-only
-# run of the image ("m"), an import of the file into ramfs: ("I") and the
+# run of the image ("M"), an import of the file into ramfs: ("I") and the
 # shell's "http" download of it into ramfs:, each between marker lines. The
 # host stamps the marker lines as they reach the serial console; a step's
 # time is the gap between its markers. The image's copy time is the import
