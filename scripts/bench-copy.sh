@@ -1,16 +1,22 @@
 #!/usr/bin/env bash
-# Times a copy of a large file (256 MiB by default) from the Samba test share
-# to ramfs: with the hosted shell's cp through the network volume, next to
-# smbclient's get of the same file in the same run. Both runs read the file
-# from a warm page cache on the server side and write to the same local file
-# system. Uses a Release build without sanitizers (build/bench-volume).
+# Times the hosted program's import of a large file (action "I", 256 MiB by
+# default) from the Samba test share into ramfs:, next to smbclient's get of
+# the same file into a file on the same disk, in alternating runs, and prints
+# the medians, their ratio and the most pool bytes the image had in use at
+# once during the import. Both read the file from a warm page cache on the
+# server side. The file lies in the share's root: the import looks for its
+# copy under the file's own directories in ramfs:, and copies a file from a
+# directory that ramfs: lacks a second time. Uses a Release build without sanitizers (build/bench-volume).
 #
-#   bench-copy.sh [runs]        (SIZE_MIB=256 by default)
+#   bench-copy.sh [runs]        (5 by default; SIZE_MIB=256 by default)
+#
+# Run it in a private network and mount namespace when other Samba runs
+# share the machine.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 ROOT=$(pwd)
 BUILD=${BUILD:-$ROOT/build/bench-volume}
-RUNS=${1:-3}
+RUNS=${1:-5}
 SIZE_MIB=${SIZE_MIB:-256}
 STATE_DIR=/tmp/cifsdrv-samba
 SHARE_DIR=$STATE_DIR/share-smb2_10
@@ -20,54 +26,66 @@ SMB_SHARE=cifsshare
 
 echo "== Release build without sanitizers ($BUILD)"
 cmake -S . -B "$BUILD" -G Ninja -DCIFSDRV_SANITIZE=OFF -DCMAKE_BUILD_TYPE=Release >/dev/null
-ninja -C "$BUILD" -j2 integration_tests >/dev/null
+ninja -C "$BUILD" -j2 cifsdrv >/dev/null
 
-# The server is shared with the test suites: (re)start it with this
-# configuration before every measurement.
-server() {
-  SMB_STATE_DIR=$STATE_DIR SMB_MIN_PROTO=SMB2_02 SMB_MAX_PROTO=SMB2_10 SMB_USER=$SMB_USER \
-    SMB_PASS=$SMB_PASS SMB_SHARE=$SMB_SHARE SMB_DIR=$SHARE_DIR \
-    bash scripts/samba-test-server.sh start
-}
+SMB_ENV=(SMB_STATE_DIR=$STATE_DIR SMB_MIN_PROTO=SMB2_02 SMB_MAX_PROTO=SMB2_10 SMB_USER=$SMB_USER
+  SMB_PASS=$SMB_PASS SMB_SHARE=$SMB_SHARE SMB_DIR=$SHARE_DIR)
 echo "== Samba on loopback"
-server
+env "${SMB_ENV[@]}" bash scripts/samba-test-server.sh start
 
-BENCH_DIR=$SHARE_DIR/bench-copy
-OUT=$(mktemp -d)
-cleanup() { rm -rf "$BENCH_DIR" "$OUT"; }
+# Both copies go to the same file system (/tmp: a tmpfs in the private
+# namespace the tests run in, so that neither waits for a disk).
+OUT=$(mktemp -d "${TMPDIR:-/tmp}/bench-copy.XXXXXX")
+FILE=bench-copy.bin
+cleanup() {
+  rm -rf "$SHARE_DIR/$FILE" "$OUT"
+  env "${SMB_ENV[@]}" bash scripts/samba-test-server.sh stop >/dev/null 2>&1 || true
+}
 trap cleanup EXIT
-mkdir -p "$BENCH_DIR"
-chmod 0777 "$BENCH_DIR"
-head -c $((SIZE_MIB * 1048576)) /dev/urandom >"$BENCH_DIR/big.bin"
-chmod 0666 "$BENCH_DIR/big.bin"
-cat "$BENCH_DIR/big.bin" >/dev/null # warm the server's page cache
+mkdir -p "$OUT/ramfs"
+head -c $((SIZE_MIB * 1048576)) /dev/urandom >"$SHARE_DIR/$FILE"
+chmod 0666 "$SHARE_DIR/$FILE"
+cat "$SHARE_DIR/$FILE" >/dev/null # warm the server's page cache
 
 now() { date +%s.%N; }
-median() { sort -n | awk '{ v[NR] = $1 } END { print (NR % 2) ? v[(NR + 1) / 2] : (v[NR / 2] + v[NR / 2 + 1]) / 2 }'; }
-CP_TIMES=()
+median() { sort -g | awk '{ v[NR] = $1 } END { print (NR % 2) ? v[(NR + 1) / 2] : (v[NR / 2] + v[NR / 2 + 1]) / 2 }'; }
+IMPORT_TIMES=()
 GET_TIMES=()
+PEAKS=()
 for run in $(seq 1 "$RUNS"); do
-  echo "-- run $run"
-  server
-  line=$(CIFSDRV_BENCH_FILE=bench-copy/big.bin "$BUILD/tests/integration_tests" \
-    --gtest_also_run_disabled_tests --gtest_filter='NwVolumeSambaTest.DISABLED_CopyBenchmark' |
-    grep -E "^cp through") || { echo "benchmark test failed"; exit 1; }
-  echo "$line"
-  CP_TIMES+=("$(echo "$line" | awk '{ print $(NF - 3) }')")
+  rm -f "$OUT/ramfs/$FILE" "$OUT/vars.txt"
+  start=$(now)
+  rc=0
+  CIFSDRV_RAMFS=$OUT/ramfs CIFSDRV_VARSTORE=$OUT/vars.txt CIFSDRV_POOL_PEAK=1 \
+    "$BUILD/cifsdrv" I "$SMB_SHARE" 127.0.0.1 "$SMB_USER" "$SMB_PASS" "$FILE" \
+    >"$OUT/import.log" 2>&1 || rc=$?
+  end=$(now)
+  if [ "$rc" -ne 0 ] || ! cmp -s "$OUT/ramfs/$FILE" "$SHARE_DIR/$FILE"; then
+    tail -20 "$OUT/import.log"
+    echo "the import failed (exit $rc) or its copy differs"
+    exit 1
+  fi
+  IMPORT_TIMES+=("$(awk -v s="$start" -v e="$end" 'BEGIN { printf "%.3f", e - s }')")
+  PEAKS+=("$(sed -n 's/^cifsdrv: pool peak: \([0-9]*\) bytes$/\1/p' "$OUT/import.log")")
+  rm -f "$OUT/ramfs/$FILE"
+
   rm -f "$OUT/big.bin"
-  server
   start=$(now)
   smbclient -m SMB2_10 "//127.0.0.1/$SMB_SHARE" -U "$SMB_USER%$SMB_PASS" \
-    -c "get bench-copy/big.bin $OUT/big.bin" >"$OUT/smbclient.log" 2>&1 ||
+    -c "get $FILE $OUT/big.bin" >"$OUT/smbclient.log" 2>&1 ||
     { cat "$OUT/smbclient.log"; exit 1; }
   end=$(now)
-  cmp -s "$OUT/big.bin" "$BENCH_DIR/big.bin" || { echo "smbclient copy differs"; exit 1; }
+  cmp -s "$OUT/big.bin" "$SHARE_DIR/$FILE" || { echo "smbclient copy differs"; exit 1; }
+  rm -f "$OUT/big.bin"
   GET_TIMES+=("$(awk -v s="$start" -v e="$end" 'BEGIN { printf "%.3f", e - s }')")
-  echo "smbclient get:         ${GET_TIMES[-1]} s"
+  echo "run $run: import ${IMPORT_TIMES[-1]} s (pool peak ${PEAKS[-1]} bytes), smbclient get ${GET_TIMES[-1]} s"
 done
-cp_median=$(printf '%s\n' "${CP_TIMES[@]}" | median)
+import_median=$(printf '%s\n' "${IMPORT_TIMES[@]}" | median)
 get_median=$(printf '%s\n' "${GET_TIMES[@]}" | median)
+peak=$(printf '%s\n' "${PEAKS[@]}" | sort -g | tail -n 1)
 echo "== medians of $RUNS runs, $SIZE_MIB MiB"
-awk -v c="$cp_median" -v g="$get_median" -v m="$SIZE_MIB" 'BEGIN {
-  printf "cp through the volume to ramfs: %.3f s (%.1f MiB/s)\n", c, m / c
-  printf "smbclient get:                  %.3f s (%.1f MiB/s)\n", g, m / g }'
+awk -v c="$import_median" -v g="$get_median" -v m="$SIZE_MIB" -v p="$peak" 'BEGIN {
+  printf "cifsdrv I into ramfs:  %.3f s (%.1f MiB/s)\n", c, m / c
+  printf "smbclient get:         %.3f s (%.1f MiB/s)\n", g, m / g
+  printf "ratio get / import:    %.2f\n", g / c
+  printf "pool peak:             %d bytes (%.2f MiB)\n", p, p / 1048576 }'

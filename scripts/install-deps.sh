@@ -4,7 +4,7 @@
 # protocol headers; make, perl and dpkg-dev to fetch and prepare OpenSSL's
 # sources for the image), QEMU and OVMF with mtools for the firmware tests,
 # OpenSSL and GoogleTest for the hosted build, Samba and tshark for the
-# network tests.
+# network tests, python3 for the firmware benchmark's HTTP server.
 #
 # Idempotent: when every package is already installed, apt is not run at all.
 # Works as root (no sudo needed), without a terminal and with CI=true.
@@ -14,7 +14,7 @@ PACKAGES=(
   cmake ninja-build g++ clang lld gnu-efi make perl dpkg-dev
   libssl-dev googletest libgtest-dev
   qemu-system-x86 ovmf mtools
-  samba smbclient tshark
+  samba smbclient tshark python3
 )
 
 missing=()

@@ -26,6 +26,7 @@ namespace {
 // ---------------------------------------------------------------------------
 std::unordered_map<void *, size_t> gPoolBlocks;
 uint64_t gPoolBytes = 0;
+uint64_t gPoolPeakBytes = 0;     // the most gPoolBytes has been since the last reset
 uint64_t gPoolFailCountdown = 0; // 0: off; 1: the next allocation fails
 
 std::unordered_map<void *, UINTN> gPages; // address -> page count
@@ -476,6 +477,9 @@ void *HostPoolAllocate(size_t Size) {
   if (Block != nullptr) {
     gPoolBlocks[Block] = Size;
     gPoolBytes += Size;
+    if (gPoolBytes > gPoolPeakBytes) {
+      gPoolPeakBytes = gPoolBytes;
+    }
   }
   return Block;
 }
@@ -573,6 +577,14 @@ uint64_t HostPoolOutstanding() {
 
 uint64_t HostPoolOutstandingBytes() {
   return gPoolBytes;
+}
+
+uint64_t HostPoolPeakBytes() {
+  return gPoolPeakBytes;
+}
+
+void HostPoolResetPeak() {
+  gPoolPeakBytes = gPoolBytes;
 }
 
 void HostPoolFailAfter(uint64_t Allocations) {

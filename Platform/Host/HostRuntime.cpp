@@ -12,8 +12,12 @@
 // in UTF-8, the attributes in hexadecimal and the data as hexadecimal bytes.
 // In the name, '%', space and control characters are written as %XX escapes
 // of their UTF-8 bytes. Empty data is written as "-". The file is rewritten
-// after every change, through a temporary file and a rename, so that a reader
-// never sees half a store.
+// whole, through a temporary file and a rename, so that a reader never sees
+// half a store: at once after every change to a non-volatile variable, and
+// at exit (HostShutdown or ResetSystem) after changes to volatile ones only,
+// which live in memory until then. A run records its status in a volatile
+// variable after every network operation; writing the file each time would
+// cost more than the operation.
 #include "HostCore.h"
 
 #include <stdio.h>
@@ -52,6 +56,7 @@ constexpr const char *StoreHeader =
 
 std::vector<HostVariable> gVariables; // creation order, the order of GetNextVariableName
 std::string gStorePath;
+bool gStoreDirty = false; // volatile changes not yet in the file
 uint32_t gHighMonotonicCount = 0;
 
 size_t NameLength(const CHAR16 *Name) {
@@ -289,7 +294,14 @@ bool WriteStore() {
     unlink(Temporary.c_str());
     return false;
   }
+  gStoreDirty = false;
   return true;
+}
+
+void FlushStore() {
+  if (gStoreDirty && !WriteStore()) {
+    fprintf(stderr, "host: cannot write the variable store %s\n", gStorePath.c_str());
+  }
 }
 
 // ---------------------------------------------------------------------------
@@ -394,7 +406,14 @@ EFI_STATUS EFIAPI RtSetVariable(const CHAR16 *VariableName, const EFI_GUID *Vend
       V->Data.size() + NameBytes + DataSize > MaxVariableSize) {
     return EFI_OUT_OF_RESOURCES;
   }
-  std::vector<HostVariable> Previous = gVariables;
+  // A change that touches a non-volatile variable (a deletion included) goes
+  // to the file at once; any other waits for the exit.
+  const bool NonVolatile =
+      ((Stored | (V != nullptr ? V->Attributes : 0)) & EFI_VARIABLE_NON_VOLATILE) != 0;
+  std::vector<HostVariable> Previous;
+  if (NonVolatile) {
+    Previous = gVariables;
+  }
   if (Delete) {
     gVariables.erase(gVariables.begin() + (V - gVariables.data()));
   } else if (V == nullptr) {
@@ -404,6 +423,10 @@ EFI_STATUS EFIAPI RtSetVariable(const CHAR16 *VariableName, const EFI_GUID *Vend
     V->Data.insert(V->Data.end(), Bytes, Bytes + DataSize);
   } else {
     V->Data.assign(Bytes, Bytes + DataSize);
+  }
+  if (!NonVolatile) {
+    gStoreDirty = true;
+    return EFI_SUCCESS;
   }
   if (!WriteStore()) {
     fprintf(stderr, "host: cannot write the variable store %s\n", gStorePath.c_str());
@@ -491,6 +514,7 @@ EFI_STATUS EFIAPI RtGetNextHighMonotonicCount(UINT32 *HighCount) {
 
 // A reset ends the host program; the status's low byte is its exit code.
 void EFIAPI RtResetSystem(EFI_RESET_TYPE ResetType, EFI_STATUS ResetStatus, UINTN, void *) {
+  FlushStore();
   fflush(stdout);
   fprintf(stderr, "host: ResetSystem(%u) with status 0x%llx\n", static_cast<unsigned>(ResetType),
           static_cast<unsigned long long>(ResetStatus));
@@ -526,14 +550,23 @@ void HostRuntimeFill(EFI_RUNTIME_SERVICES *Rt) {
 
 void HostVariablesOpen(const char *Path) {
   gStorePath = Path;
+  gStoreDirty = false;
   LoadStore();
 }
 
 void HostVariablesClose() {
+  FlushStore();
   gVariables.clear();
   gStorePath.clear();
 }
 
 void HostVariablesReload() {
   LoadStore();
+  gStoreDirty = false;
+}
+
+void HostVariablesFlush() {
+  if (!WriteStore()) {
+    fprintf(stderr, "host: cannot write the variable store %s\n", gStorePath.c_str());
+  }
 }

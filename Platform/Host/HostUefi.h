@@ -34,13 +34,19 @@ EFI_STATUS HostRunImage(int Argc, char **Argv);
 // Pool accounting: blocks handed out by AllocatePool and not yet freed.
 uint64_t HostPoolOutstanding();
 uint64_t HostPoolOutstandingBytes();
+// The most bytes outstanding at once since the environment was set up, or
+// since the last HostPoolResetPeak (which starts it at what is in use now).
+uint64_t HostPoolPeakBytes();
+void HostPoolResetPeak();
 
 // Delivers due timer notifications (also done inside every boot-services
 // call, never from a signal handler).
 void HostDispatchTimers();
 
-// Variable store: reload from the file named in HostConfig.
+// Variable store: reload from / flush to the file named in HostConfig. A
+// reload drops volatile changes not yet written (which HostShutdown writes).
 void HostVariablesReload();
+void HostVariablesFlush();
 
 // Fake IPMI transport in the configuration table under
 // {4F6B6541-ADD6-4B0F-A503-D78ABDA0851E}. With Enabled false the table entry

@@ -12,7 +12,6 @@
 #include <sys/stat.h>
 
 #include <algorithm>
-#include <chrono>
 #include <fstream>
 #include <random>
 #include <string>
@@ -676,25 +675,6 @@ TEST_F(NwVolumeSambaTest, ShellCopiesToRamfsAndBackByteIdentical) {
   Shell(u"cp -q ramfs:\\copy.bin " + Drive + At("back.bin"));
   EXPECT_TRUE(GetFile("back.bin") == Data);
   // TearDown unmounts and checks that the pool is back where it started.
-}
-
-// The copy timing of scripts/bench-copy.sh, run only on request: the file
-// named by CIFSDRV_BENCH_FILE (relative to the share's directory) is copied to
-// ramfs: with the hosted shell's cp, through the volume.
-TEST_F(NwVolumeSambaTest, DISABLED_CopyBenchmark) {
-  const char *Name = getenv("CIFSDRV_BENCH_FILE");
-  ASSERT_NE(Name, nullptr) << "CIFSDRV_BENCH_FILE is not set";
-  std::u16string Drive = MapVolume();
-  ASSERT_FALSE(Drive.empty());
-  std::u16string Source = U16(std::string("\\") + Name);
-  std::replace(Source.begin(), Source.end(), u'/', u'\\');
-  auto Start = std::chrono::steady_clock::now();
-  Shell(u"cp -q " + Drive + Source + u" ramfs:\\bench.bin");
-  double Seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - Start).count();
-  uintmax_t Size = std::filesystem::file_size(kShareDir + "/" + Name);
-  EXPECT_EQ(std::filesystem::file_size(Dir + "/ramfs/bench.bin"), Size);
-  printf("cp through the volume: %llu bytes in %.3f s (%.1f MiB/s)\n",
-         static_cast<unsigned long long>(Size), Seconds, Size / Seconds / kMiB);
 }
 
 } // namespace

@@ -328,7 +328,12 @@ TEST_F(HostEnv, VariablesRoundTripThroughTheStoreFile) {
   const uint8_t Other[1] = {0x5A};
   ASSERT_EQ(Rt->SetVariable(u"odd name%é", &kGuidA, 2, 1, Other), EFI_SUCCESS);
 
+  // The non-volatile change wrote the file; the volatile one waits in memory.
   std::string Text = ReadStore();
+  EXPECT_NE(Text.find(" PROVISIONING_ENV_VAR 3 "), std::string::npos) << Text;
+  EXPECT_EQ(Text.find(" odd%20name"), std::string::npos) << Text;
+  HostVariablesFlush();
+  Text = ReadStore();
   EXPECT_EQ(Text[0], '#');
   EXPECT_NE(Text.find("\n{4C4AC96B-DD0A-447E-8118-105900DA8629} PROVISIONING_ENV_VAR 3 00ff10ab\n"),
             std::string::npos)
@@ -353,8 +358,13 @@ TEST_F(HostEnv, VariablesRoundTripThroughTheStoreFile) {
   ASSERT_EQ(Rt->GetVariable(u"odd name%é", &kGuidA, nullptr, &Size, Buffer), EFI_SUCCESS);
   EXPECT_EQ(Buffer[0], 0x5A);
 
-  // A fresh environment on the same file sees the same store.
+  // A fresh environment on the same file sees the same store, the volatile
+  // change made last included (written at shutdown).
+  const uint8_t Late[1] = {0x77};
+  ASSERT_EQ(Rt->SetVariable(u"Late", &kGuidA, 2, 1, Late), EFI_SUCCESS);
+  EXPECT_EQ(ReadStore().find(" Late "), std::string::npos);
   HostShutdown();
+  EXPECT_NE(ReadStore().find(" Late 2 77\n"), std::string::npos);
   HostConfig Config;
   Config.RamfsDir = RamfsDir.c_str();
   Config.VarStore = VarStore.c_str();
