@@ -125,38 +125,96 @@ UINT32 RequestCap(bool Write) {
 }
 
 // The read or the write of *Size bytes at the prepared offset, in requests
-// of at most RequestCap bytes, each advancing by what the server moved. An
+// of at most RequestCap bytes, each advancing by what the server moved (a
+// read starts with what the read-ahead holds and asks for a whole request
+// at its tail). An
 // answer that moves nothing (a read without data before the end asked for, a
 // write the server did not take), or more short answers than allowed, fails
 // the transfer. *Size receives what was moved.
+// The rest of a read's last request that its caller did not ask for, kept
+// for the next read of the same file if it begins where this one ended: a
+// caller whose buffer is no multiple of a request (a shell's copy) still
+// reads in whole requests instead of a small one after every few.
+struct READ_AHEAD {
+  UINT8 FileId[SMB2_FILE_ID_SIZE];
+  UINT64 Offset; // file offset of Data[Start]
+  UINT32 Start;
+  UINT32 Length; // bytes kept from Start
+  UINT8 Data[SMB2_FS_MAX_CHUNK];
+};
+READ_AHEAD gReadAhead;
+
+// Moves what the read-ahead holds for the open file at the current offset
+// into Buffer (at most Wanted bytes); anything else it holds is dropped.
+UINTN TakeReadAhead(UINT8 *Buffer, UINTN Wanted) {
+  READ_AHEAD &Ahead = gReadAhead;
+  SMB2_READ_WRITE_INFO &Rw = Access().ReadWriteInfo;
+  if (Ahead.Length == 0 || Ahead.Offset != Rw.FileOffset ||
+      CompareMem(Ahead.FileId, Access().FileId, SMB2_FILE_ID_SIZE) != 0) {
+    Ahead.Length = 0;
+    return 0;
+  }
+  UINTN Taken = Wanted < Ahead.Length ? Wanted : Ahead.Length;
+  CopyMem(Buffer, Ahead.Data + Ahead.Start, Taken);
+  Ahead.Start += static_cast<UINT32>(Taken);
+  Ahead.Length -= static_cast<UINT32>(Taken);
+  Ahead.Offset += Taken;
+  Rw.FileOffset += Taken;
+  return Taken;
+}
+
+// Keeps what a read-ahead request brought beyond the Used bytes its caller
+// wanted.
+void KeepReadAhead(UINT64 Used, UINT64 Moved) {
+  READ_AHEAD &Ahead = gReadAhead;
+  CopyMem(Ahead.FileId, Access().FileId, SMB2_FILE_ID_SIZE);
+  Ahead.Start = static_cast<UINT32>(Used);
+  Ahead.Length = static_cast<UINT32>(Moved - Used);
+  Ahead.Offset = Access().ReadWriteInfo.FileOffset + Used;
+}
+
 EFI_STATUS Transfer(bool Write, UINT8 *Buffer, UINTN *Size) {
   FILE_ACCESS_DETAILS &F = Access();
   SMB2_READ_WRITE_INFO &Rw = F.ReadWriteInfo;
   const UINTN Requested = *Size;
   const UINT32 Cap = RequestCap(Write);
   UINTN Total = 0;
+  if (Write) {
+    gReadAhead.Length = 0;
+  } else {
+    Total = TakeReadAhead(Buffer, Requested);
+  }
   UINT32 ShortAnswers = 0;
   EFI_STATUS Status = EFI_SUCCESS;
   while (Total < Requested) {
-    Rw.Length = static_cast<UINT32>(Requested - Total < Cap ? Requested - Total : Cap);
+    const UINTN Left = Requested - Total;
+    // The tail of a read asks for a whole request; its rest is kept.
+    const bool Ahead = !Write && Left < Cap;
+    Rw.Length = static_cast<UINT32>(Ahead || Left > Cap ? Cap : Left);
     Rw.BytesRead = 0;
     Rw.BytesWritten = 0;
-    Status = Write ? SMB2_Write(&gSMB2ShareDetails, &gSMB2ClientSession, &gQueryDetails, &F,
-                                Buffer + Total)
-                   : SMB2_Read(&gSMB2ShareDetails, &gSMB2ClientSession, &gQueryDetails, &F,
-                               Buffer + Total);
+    UINT8 *Target = Ahead ? gReadAhead.Data : Buffer + Total;
+    Status = Write ? SMB2_Write(&gSMB2ShareDetails, &gSMB2ClientSession, &gQueryDetails, &F, Target)
+                   : SMB2_Read(&gSMB2ShareDetails, &gSMB2ClientSession, &gQueryDetails, &F, Target);
     if (EFI_ERROR(Status)) {
       ReportTransferFailure(Write, &Status);
       break;
     }
     UINT64 Moved = Write ? Rw.BytesWritten : Rw.BytesRead;
-    if (Moved < Rw.Length && (Moved == 0 || ++ShortAnswers > SMB2_FS_MAX_SHORT_ANSWERS)) {
+    UINT64 Needed = Ahead ? Left : Rw.Length;
+    if (Moved < Needed && (Moved == 0 || ++ShortAnswers > SMB2_FS_MAX_SHORT_ANSWERS)) {
       Smb2Log(DIAG_ALWAYS,
               "Function: %s, Line no.: = %d, %s of %u bytes at offset %ld moved %ld bytes!\n",
               Write ? "SMB2_FWrite" : "SMB2_FRead", __LINE__, Write ? "WRITE" : "READ", Rw.Length,
               static_cast<INT64>(Rw.FileOffset), static_cast<INT64>(Moved));
       Status = EFI_DEVICE_ERROR;
       break;
+    }
+    if (Ahead) {
+      UINT64 Used = Moved < Left ? Moved : Left;
+      CopyMem(Buffer + Total, gReadAhead.Data, Used);
+      KeepReadAhead(Used, Moved);
+      Moved = Used;
     }
     Total += static_cast<UINTN>(Moved);
     Rw.FileOffset += Moved;
@@ -221,6 +279,7 @@ void ReleaseConnectBuffers() {
 // Releases what FileAccessDetails owns and clears it with the query record,
 // the session record and the listing.
 void ReleaseFileRecords() {
+  gReadAhead.Length = 0;
   FreePool(Access().DirInfoPtr);
   FreePool(Access().FullDirInfoPtr);
   SMB2FreeCreateContexts(&Access());
@@ -405,6 +464,7 @@ EFI_STATUS SMB2_FOpen(NW_SHARE_INFO *Volume, NW_REMOTE_FILE *File, UINT64 OpenMo
     return InvalidParameter(__func__);
   }
   FILE_ACCESS_DETAILS &F = Access();
+  gReadAhead.Length = 0;
   SetRemoteNameWide(File->FileName, kRemoteNameChars);
   F.SecurityFlags = 0;
   F.RequestedOplockLevel = File->OplockLevel;
@@ -463,6 +523,7 @@ EFI_STATUS SMB2_FClose(NW_SHARE_INFO *Volume, NW_REMOTE_FILE *File) {
     return InvalidParameter(__func__);
   }
   FILE_ACCESS_DETAILS &F = Access();
+  gReadAhead.Length = 0;
   CopyMem(F.FileId, File->FileId, SMB2_FILE_ID_SIZE);
   F.SecurityFlags = 0;
   EFI_STATUS Status = SMB2_Close(&F);

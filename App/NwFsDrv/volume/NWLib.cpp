@@ -40,9 +40,14 @@ EFI_STATUS SetOperationStatus(EFI_STATUS Status) {
   if (EFI_ERROR(Read) || Size == 0) {
     DiagError("GetVariable failed!", Read);
   }
+  DiagLog(DIAG_VERBOSE, "Operation returned. %d\n", static_cast<INT32>(Status));
+  // A record that already holds this status is left as it is: the variable
+  // reads the same, and a transfer does not rewrite it for every request.
+  if (!EFI_ERROR(Read) && Size == sizeof(Record) && Record.Status == Status) {
+    return EFI_SUCCESS;
+  }
   Record.Status = Status;
   Size = sizeof(Record);
-  DiagLog(DIAG_VERBOSE, "Operation returned. %d\n", static_cast<INT32>(Status));
   return gRT->SetVariable(PROVISIONING_VOLATILE_VAR_NAME, &gProvisioningEnvGuid,
                           PROVISIONING_VOLATILE_ATTRIBUTES, Size, &Record);
 }

@@ -125,16 +125,9 @@ EFI_STATUS ReadFile(NW_FILE_HANDLE *Handle, UINTN *BufferSize, void *Buffer) {
   if (!NwAcquireBusyLock()) {
     return EFI_ABORTED;
   }
-  // The staging buffer always has the full per-call maximum, which it is
-  // cleared over, whatever this call's limit.
-  gReadBuffer = static_cast<UINT8 *>(AllocatePool(NW_MAX_READ_PER_CALL));
-  if (gReadBuffer == nullptr) {
-    DiagError("Failed to alloate memory!", EFI_OUT_OF_RESOURCES);
-    NwReleaseBusyLock();
-    *BufferSize = 0;
-    return EFI_OUT_OF_RESOURCES;
-  }
-  ZeroMem(gReadBuffer, NW_MAX_READ_PER_CALL);
+  // The data goes straight into the caller's buffer; what it held is
+  // undefined after a failed read, whose size is 0.
+  gReadBuffer = static_cast<UINT8 *>(Buffer);
   State.Staging = gReadBuffer;
   OpenFile->ReadInProgress = 1;
 
@@ -151,13 +144,7 @@ EFI_STATUS ReadFile(NW_FILE_HANDLE *Handle, UINTN *BufferSize, void *Buffer) {
   DiagLog(DIAG_VERBOSE, "FileSize = 0x%x (%ld)\n", static_cast<UINT32>(FileSize), FileSize);
   EFI_STATUS Status = ReadChunks(Handle, &State);
   NwReleaseBusyLock();
-  if (!EFI_ERROR(Status)) {
-    CopyMem(Buffer, gReadBuffer, State.Total);
-    *BufferSize = State.Total;
-  } else {
-    *BufferSize = 0;
-  }
-  FreePool(gReadBuffer);
+  *BufferSize = EFI_ERROR(Status) ? 0 : State.Total;
   gReadBuffer = nullptr;
   OpenFile->ReadInProgress = 0;
   return Status;

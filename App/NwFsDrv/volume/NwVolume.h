@@ -164,7 +164,7 @@ static_assert(offsetof(NW_VOLUME, FileHandles) == 181, "volume: handle list");
 // ---------------------------------------------------------------------------
 extern UINT64 gTotalByteRead;   // offset of the next read in the file being read
 extern UINT8 *gPrevReadOffset;  // staging address of the last chunk read (diagnostics)
-extern UINT8 *gReadBuffer;      // staging buffer, alive during one Read
+extern UINT8 *gReadBuffer;      // the buffer the current Read fills (the caller's)
 extern UINT64 gWriteOffset;     // offset of the next write; never reset
 extern UINT32 gDirReadIndex;    // cached-listing index the next directory Read delivers
 extern UINT8 gDirRewind;        // set by SetPosition(0) on a directory
