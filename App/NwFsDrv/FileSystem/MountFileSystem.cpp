@@ -93,7 +93,7 @@ EFI_STATUS FindUnicodeCollation(const CHAR8 *Language) {
 void FreeConnectionParams(NW_CONNECTION_PARAMS *Params) {
   FreePool(Params->ipAddress);
   FreePool(Params->username);
-  FreePool(Params->password);
+  FreeClearedStr(Params->password);
   ZeroMem(Params, sizeof(*Params));
 }
 
