@@ -192,6 +192,31 @@ NW_VOLUME *InstalledVolume() {
   return static_cast<NW_VOLUME *>(Interface);
 }
 
+// A mount is done only once the volume's root opens: a connection that dies
+// at the first request on the share leaves a volume nobody can use. Looking
+// up the volume's shell name opens the root already (OpenVolume, which asks
+// the share for its statistics), so a healthy mount costs no request here;
+// only a root that was never opened is opened now.
+EFI_STATUS CheckVolumeRoot() {
+  NW_VOLUME *Volume = InstalledVolume();
+  if (Volume == nullptr) {
+    return EFI_DEVICE_ERROR;
+  }
+  if (Volume->Root != nullptr && !EFI_ERROR(Volume->VolumeStatus)) {
+    return EFI_SUCCESS;
+  }
+  EFI_FILE_PROTOCOL *Root = nullptr;
+  EFI_STATUS Status = Volume->Sfs.OpenVolume(&Volume->Sfs, &Root);
+  if (EFI_ERROR(Status)) {
+    return Status;
+  }
+  if (Root == nullptr) {
+    return EFI_DEVICE_ERROR;
+  }
+  Root->Close(Root);
+  return EFI_SUCCESS;
+}
+
 // ---------------------------------------------------------------------------
 // The retry's share name
 // ---------------------------------------------------------------------------
@@ -261,6 +286,12 @@ EFI_STATUS StartMountFileSystem(const CHAR16 *ShareName, const CHAR16 *IpAddress
     EFI_STATUS NameStatus = EFI_SUCCESS;
     if (!MapShareUnderIdentifier(Identifier, kMountMapping, DriveName, &NameStatus)) {
       return NameStatus;
+    }
+    Status = CheckVolumeRoot();
+    if (EFI_ERROR(Status)) {
+      DiagLog(DIAG_ALWAYS, "The share's root could not be opened! Status = 0x%x. Unmounting...\n",
+              static_cast<UINT32>(Status));
+      UnmountStaticFileSystem(ShareName, IpAddress);
     }
   }
   DiagExit(Status, DiagChannel::Driver, "StartMountFileSystem");
