@@ -79,11 +79,13 @@ void SetCatalogKind(UINT32 Kind);
 // ---------------------------------------------------------------------------
 
 // Copies FilePath (relative to the share's root) into DestPath ("ramfs:\").
-// May return the command runner's result as it is.
+// Success only when the copy arrived whole; EFI_NOT_FOUND without the file
+// on the share; EFI_DEVICE_ERROR, with the partial copy deleted, otherwise.
 EFI_STATUS GetFileFromNWFS(UINT32 ShareType, const CHAR16 *FilePath, const CHAR16 *DestPath);
 
 // Copies catalog.xml.gz.sign from the remembered catalog directory into
-// ramfs:. Success without doing anything when the record cannot be read.
+// ramfs:, as whole as the import's copy. Success without doing anything when
+// the record cannot be read.
 EFI_STATUS CopyCatalogSignatureToRamfs();
 
 // ---------------------------------------------------------------------------

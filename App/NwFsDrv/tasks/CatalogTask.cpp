@@ -144,19 +144,23 @@ EFI_STATUS GetCatalogToRamfs(const CHAR8 *Directory, const CHAR8 *FileName) {
                          "GetCatalogFromLocalRepToRAMFS() \n");
     return EFI_OUT_OF_RESOURCES;
   }
-  RunSystemCommand(Command);
-  FreePool(Command);
-
+  const CHAR8 *SourceParts[] = {Directory, kSeparator, FileName};
   const CHAR8 *CheckParts[] = {kRamfsVolume, kSeparator, FileName};
+  CHAR8 *Source = JoinAscii(SourceParts);
   CHAR8 *CatalogFilePath = JoinAscii(CheckParts);
-  if (CatalogFilePath == nullptr) {
+  if (Source == nullptr || CatalogFilePath == nullptr) {
     DiagLog(DIAG_ALWAYS, "Error in memory allocation for CatalogFilePath in "
                          "GetCatalogFromLocalRepToRAMFS() \n");
+    FreePool(CatalogFilePath);
+    FreePool(Source);
+    FreePool(Command);
     return EFI_OUT_OF_RESOURCES;
   }
   DiagLog(DIAG_ALWAYS, "\n CatalogFilePath = %a", CatalogFilePath);
-  EFI_STATUS Status = ShellFileOpensAscii(CatalogFilePath) ? EFI_SUCCESS : EFI_NOT_FOUND;
+  EFI_STATUS Status = RunConfirmedCopy(Command, Source, CatalogFilePath);
   FreePool(CatalogFilePath);
+  FreePool(Source);
+  FreePool(Command);
   DiagLog(DIAG_ALWAYS, "Exiting from GetCatalogToRamfs() function\n");
   return Status;
 }

@@ -91,6 +91,69 @@ bool ShellFileOpensAscii(const CHAR8 *Path) {
   return Opens;
 }
 
+bool ShellFileSize(const CHAR16 *Path, UINT64 *Size) {
+  EFI_SHELL_PROTOCOL *Shell = CurrentShell();
+  if (Path == nullptr || Shell == nullptr || Shell->OpenFileByName == nullptr) {
+    return false;
+  }
+  SHELL_FILE_HANDLE File = nullptr;
+  if (Shell->OpenFileByName(Path, &File, EFI_FILE_MODE_READ) != EFI_SUCCESS || File == nullptr) {
+    return false;
+  }
+  EFI_FILE_INFO *Info = Shell->GetFileInfo(File);
+  Shell->CloseFile(File);
+  if (Info == nullptr) {
+    return false;
+  }
+  *Size = Info->FileSize;
+  FreePool(Info);
+  return true;
+}
+
+// ---------------------------------------------------------------------------
+// Copies that must arrive whole
+// ---------------------------------------------------------------------------
+
+EFI_STATUS ConfirmCopy(bool SourceFound, UINT64 SourceSize, EFI_STATUS CommandStatus,
+                       const CHAR16 *Destination) {
+  if (!SourceFound) {
+    return EFI_NOT_FOUND;
+  }
+  UINT64 Arrived = 0;
+  bool Present = ShellFileSize(Destination, &Arrived);
+  if (!EFI_ERROR(CommandStatus) && Present && Arrived == SourceSize) {
+    return EFI_SUCCESS;
+  }
+  // A copy that broke off leaves a short file behind: it must not pass for
+  // the file.
+  DiagLog(DIAG_ALWAYS, "\nCopy to %ls failed (%ld of %ld bytes, status 0x%x)\n", Destination,
+          Arrived, SourceSize, static_cast<UINT32>(CommandStatus));
+  if (Present) {
+    const CHAR16 *Parts[] = {u"del -q ", Destination};
+    CHAR16 *Command = JoinText(Parts);
+    if (Command != nullptr) {
+      RunSystemCommandW(Command);
+      FreePool(Command);
+    }
+  }
+  return EFI_DEVICE_ERROR;
+}
+
+EFI_STATUS RunConfirmedCopy(const CHAR8 *CommandLine, const CHAR8 *Source,
+                            const CHAR8 *Destination) {
+  CHAR16 *WideSource = AsciiStrDupToUnicode(Source);
+  CHAR16 *WideDestination = AsciiStrDupToUnicode(Destination);
+  EFI_STATUS Status = EFI_OUT_OF_RESOURCES;
+  if (WideSource != nullptr && WideDestination != nullptr) {
+    UINT64 SourceSize = 0;
+    bool SourceFound = ShellFileSize(WideSource, &SourceSize);
+    Status = ConfirmCopy(SourceFound, SourceSize, RunSystemCommand(CommandLine), WideDestination);
+  }
+  FreePool(WideSource);
+  FreePool(WideDestination);
+  return Status;
+}
+
 // ---------------------------------------------------------------------------
 // The mounted share's shell name
 // ---------------------------------------------------------------------------
