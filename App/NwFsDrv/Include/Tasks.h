@@ -58,13 +58,16 @@ constexpr UINT32 CATALOG_KIND_XML_GZ = 2; // "catalog.xml.gz"
 
 // Fetches catalog.xml.gz or catalog.xml from CatalogDir (relative to the
 // share's root) or, without one, from the share's root, "catalog" and
-// "repository", into ramfs:, and remembers the directory and the kind.
+// "repository", into ramfs:, and remembers the directory and the kind. The
+// first catalog found ends the search: its copy decides the result, and only
+// a copy that arrived whole is remembered.
 EFI_STATUS GetCatalogFromNwFS(UINT32 ShareType, const CHAR16 *CatalogDir, BOOLEAN RootOnly);
 // Looks for the catalog of the given kind in Directory (8-bit, a trailing
 // separator is removed in place) and copies it to ramfs: when it is not
 // directly visible.
 EFI_STATUS CheckCatalogLocation(CHAR8 *Directory, UINT32 Kind);
-// "cp -q <Directory>\<FileName> ramfs:\", then checks that the copy exists.
+// "cp -q <Directory>\<FileName> ramfs:\"; the copy counts only when it holds
+// as many bytes as the file on the share (see ConfirmCopy).
 EFI_STATUS GetCatalogToRamfs(const CHAR8 *Directory, const CHAR8 *FileName);
 // "del -q ramfs:\<FileName>".
 void DeleteCatalogFromRAMFS(const CHAR8 *FileName);
