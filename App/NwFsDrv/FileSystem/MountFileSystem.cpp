@@ -195,14 +195,18 @@ NW_VOLUME *InstalledVolume() {
 // A mount is done only once the volume's root opens: a connection that dies
 // at the first request on the share leaves a volume nobody can use. Looking
 // up the volume's shell name opens the root already (OpenVolume, which asks
-// the share for its statistics), so a healthy mount costs no request here;
-// only a root that was never opened is opened now.
+// the share for its statistics and keeps a failure as the volume's status),
+// so what it found is taken; only a root nobody tried to open is opened now.
 EFI_STATUS CheckVolumeRoot() {
   NW_VOLUME *Volume = InstalledVolume();
   if (Volume == nullptr) {
     return EFI_DEVICE_ERROR;
   }
-  if (Volume->Root != nullptr && !EFI_ERROR(Volume->VolumeStatus)) {
+  EFI_STATUS VolumeStatus = Volume->VolumeStatus;
+  if (EFI_ERROR(VolumeStatus)) {
+    return VolumeStatus;
+  }
+  if (Volume->Root != nullptr) {
     return EFI_SUCCESS;
   }
   EFI_FILE_PROTOCOL *Root = nullptr;
