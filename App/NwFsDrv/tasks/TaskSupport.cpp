@@ -71,13 +71,25 @@ void PrintCommandStatus(EFI_STATUS Status, UINT32 Line) {
   DiagLog(DIAG_ALWAYS, "\n (%d)Status = [%d]\n", Line, static_cast<INT32>(Status));
 }
 
-bool ShellFileOpens(const CHAR16 *Path) {
-  EFI_SHELL_PROTOCOL *Shell = CurrentShell();
-  if (Path == nullptr || Shell == nullptr || Shell->OpenFileByName == nullptr) {
-    return false;
-  }
+namespace {
+
+// Path opened for reading through the shell, or null.
+SHELL_FILE_HANDLE OpenThroughShell(const CHAR16 *Path, EFI_SHELL_PROTOCOL **Shell) {
+  *Shell = CurrentShell();
   SHELL_FILE_HANDLE File = nullptr;
-  if (Shell->OpenFileByName(Path, &File, EFI_FILE_MODE_READ) != EFI_SUCCESS || File == nullptr) {
+  if (Path == nullptr || *Shell == nullptr || (*Shell)->OpenFileByName == nullptr ||
+      (*Shell)->OpenFileByName(Path, &File, EFI_FILE_MODE_READ) != EFI_SUCCESS) {
+    return nullptr;
+  }
+  return File;
+}
+
+} // namespace
+
+bool ShellFileOpens(const CHAR16 *Path) {
+  EFI_SHELL_PROTOCOL *Shell = nullptr;
+  SHELL_FILE_HANDLE File = OpenThroughShell(Path, &Shell);
+  if (File == nullptr) {
     return false;
   }
   Shell->CloseFile(File);
@@ -92,12 +104,9 @@ bool ShellFileOpensAscii(const CHAR8 *Path) {
 }
 
 bool ShellFileSize(const CHAR16 *Path, UINT64 *Size) {
-  EFI_SHELL_PROTOCOL *Shell = CurrentShell();
-  if (Path == nullptr || Shell == nullptr || Shell->OpenFileByName == nullptr) {
-    return false;
-  }
-  SHELL_FILE_HANDLE File = nullptr;
-  if (Shell->OpenFileByName(Path, &File, EFI_FILE_MODE_READ) != EFI_SUCCESS || File == nullptr) {
+  EFI_SHELL_PROTOCOL *Shell = nullptr;
+  SHELL_FILE_HANDLE File = OpenThroughShell(Path, &Shell);
+  if (File == nullptr) {
     return false;
   }
   EFI_FILE_INFO *Info = Shell->GetFileInfo(File);
