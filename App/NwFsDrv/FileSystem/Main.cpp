@@ -54,9 +54,10 @@ EFI_STATUS CopyArguments(INTN Argc, CHAR8 **Argv, MAIN_ARGUMENTS *Arguments) {
   return EFI_SUCCESS;
 }
 
+// One of the copies is the password: every copy is cleared before it goes.
 void FreeArguments(MAIN_ARGUMENTS *Arguments) {
   for (CHAR16 *&Copy : Arguments->Slot) {
-    FreePool(Copy);
+    FreeClearedStr(Copy);
     Copy = nullptr;
   }
 }

@@ -93,7 +93,7 @@ EFI_STATUS FindUnicodeCollation(const CHAR8 *Language) {
 void FreeConnectionParams(NW_CONNECTION_PARAMS *Params) {
   FreePool(Params->ipAddress);
   FreePool(Params->username);
-  FreePool(Params->password);
+  FreeClearedStr(Params->password);
   ZeroMem(Params, sizeof(*Params));
 }
 
@@ -192,6 +192,35 @@ NW_VOLUME *InstalledVolume() {
   return static_cast<NW_VOLUME *>(Interface);
 }
 
+// A mount is done only once the volume's root opens: a connection that dies
+// at the first request on the share leaves a volume nobody can use. Looking
+// up the volume's shell name opens the root already (OpenVolume, which asks
+// the share for its statistics and keeps a failure as the volume's status),
+// so what it found is taken; only a root nobody tried to open is opened now.
+EFI_STATUS CheckVolumeRoot() {
+  NW_VOLUME *Volume = InstalledVolume();
+  if (Volume == nullptr) {
+    return EFI_DEVICE_ERROR;
+  }
+  EFI_STATUS VolumeStatus = Volume->VolumeStatus;
+  if (EFI_ERROR(VolumeStatus)) {
+    return VolumeStatus;
+  }
+  if (Volume->Root != nullptr) {
+    return EFI_SUCCESS;
+  }
+  EFI_FILE_PROTOCOL *Root = nullptr;
+  EFI_STATUS Status = Volume->Sfs.OpenVolume(&Volume->Sfs, &Root);
+  if (EFI_ERROR(Status)) {
+    return Status;
+  }
+  if (Root == nullptr) {
+    return EFI_DEVICE_ERROR;
+  }
+  Root->Close(Root);
+  return EFI_SUCCESS;
+}
+
 // ---------------------------------------------------------------------------
 // The retry's share name
 // ---------------------------------------------------------------------------
@@ -261,6 +290,12 @@ EFI_STATUS StartMountFileSystem(const CHAR16 *ShareName, const CHAR16 *IpAddress
     EFI_STATUS NameStatus = EFI_SUCCESS;
     if (!MapShareUnderIdentifier(Identifier, kMountMapping, DriveName, &NameStatus)) {
       return NameStatus;
+    }
+    Status = CheckVolumeRoot();
+    if (EFI_ERROR(Status)) {
+      DiagLog(DIAG_ALWAYS, "The share's root could not be opened! Status = 0x%x. Unmounting...\n",
+              static_cast<UINT32>(Status));
+      UnmountStaticFileSystem(ShareName, IpAddress);
     }
   }
   DiagExit(Status, DiagChannel::Driver, "StartMountFileSystem");

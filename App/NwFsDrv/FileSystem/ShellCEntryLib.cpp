@@ -33,9 +33,11 @@ CHAR8 **NarrowArguments(UINTN Argc, CHAR16 **Argv) {
   return Narrow;
 }
 
+// The command line carries the password: the copies are cleared before they
+// go back to the pool.
 void FreeArguments(UINTN Argc, CHAR8 **Argv) {
   for (UINTN Index = 0; Argv != nullptr && Index < Argc; Index++) {
-    FreePool(Argv[Index]);
+    FreeClearedAsciiStr(Argv[Index]);
   }
   FreePool(Argv);
 }

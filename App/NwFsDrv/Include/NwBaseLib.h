@@ -55,6 +55,10 @@ void StrCpyS(CHAR16 *Destination, UINTN DestMax, const CHAR16 *Source);
 void StrCatS(CHAR16 *Destination, UINTN DestMax, const CHAR16 *Source);
 const CHAR16 *StrStr(const CHAR16 *String, const CHAR16 *SearchString);
 CHAR16 *StrDup(const CHAR16 *String); // pool copy, null on failure
+// Pool strings that may hold a secret: every character, the terminator
+// included, is cleared before the block goes back to the pool. Null is fine.
+void FreeClearedStr(CHAR16 *String);
+void FreeClearedAsciiStr(CHAR8 *String);
 
 // Conversions. The 8-bit side is taken as Latin-1; UCS-2 characters above
 // 0xFF narrow to '?'. Both always terminate within DestMax characters.

@@ -58,13 +58,16 @@ constexpr UINT32 CATALOG_KIND_XML_GZ = 2; // "catalog.xml.gz"
 
 // Fetches catalog.xml.gz or catalog.xml from CatalogDir (relative to the
 // share's root) or, without one, from the share's root, "catalog" and
-// "repository", into ramfs:, and remembers the directory and the kind.
+// "repository", into ramfs:, and remembers the directory and the kind. The
+// first catalog found ends the search: its copy decides the result, and only
+// a copy that arrived whole is remembered.
 EFI_STATUS GetCatalogFromNwFS(UINT32 ShareType, const CHAR16 *CatalogDir, BOOLEAN RootOnly);
 // Looks for the catalog of the given kind in Directory (8-bit, a trailing
 // separator is removed in place) and copies it to ramfs: when it is not
 // directly visible.
 EFI_STATUS CheckCatalogLocation(CHAR8 *Directory, UINT32 Kind);
-// "cp -q <Directory>\<FileName> ramfs:\", then checks that the copy exists.
+// "cp -q <Directory>\<FileName> ramfs:\"; the copy counts only when it holds
+// as many bytes as the file on the share (see ConfirmCopy).
 EFI_STATUS GetCatalogToRamfs(const CHAR8 *Directory, const CHAR8 *FileName);
 // "del -q ramfs:\<FileName>".
 void DeleteCatalogFromRAMFS(const CHAR8 *FileName);
@@ -79,11 +82,13 @@ void SetCatalogKind(UINT32 Kind);
 // ---------------------------------------------------------------------------
 
 // Copies FilePath (relative to the share's root) into DestPath ("ramfs:\").
-// May return the command runner's result as it is.
+// Success only when the copy arrived whole; EFI_NOT_FOUND without the file
+// on the share; EFI_DEVICE_ERROR, with the partial copy deleted, otherwise.
 EFI_STATUS GetFileFromNWFS(UINT32 ShareType, const CHAR16 *FilePath, const CHAR16 *DestPath);
 
 // Copies catalog.xml.gz.sign from the remembered catalog directory into
-// ramfs:. Success without doing anything when the record cannot be read.
+// ramfs:, as whole as the import's copy. Success without doing anything when
+// the record cannot be read.
 EFI_STATUS CopyCatalogSignatureToRamfs();
 
 // ---------------------------------------------------------------------------

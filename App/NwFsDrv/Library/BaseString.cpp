@@ -211,6 +211,23 @@ CHAR16 *StrDup(const CHAR16 *String) {
   return Duplicate(String);
 }
 
+namespace {
+template <typename TChar>
+void FreeCleared(TChar *String) {
+  if (String != nullptr) {
+    ZeroMem(String, (Length(String, Unbounded) + 1) * sizeof(TChar));
+    FreePool(String);
+  }
+}
+} // namespace
+
+void FreeClearedStr(CHAR16 *String) {
+  FreeCleared(String);
+}
+void FreeClearedAsciiStr(CHAR8 *String) {
+  FreeCleared(String);
+}
+
 // ---------------------------------------------------------------------------
 // Conversions
 // ---------------------------------------------------------------------------

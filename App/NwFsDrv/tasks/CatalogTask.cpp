@@ -24,15 +24,20 @@ const CHAR8 *CatalogFileName(UINT32 Kind) {
   return Kind == CATALOG_KIND_XML ? kCatalogXml : kCatalogXmlGz;
 }
 
-// Completion for a catalog found: remember where and what, then copy it.
+// Completion for a catalog found: copy it, then remember where and what. A
+// copy that fails leaves the remembered directory and kind as they were.
 EFI_STATUS CompleteCatalog(const CHAR8 *Directory, UINT32 ShareType, UINT32 Kind) {
-  PersistCatalogPath(Directory, ShareType);
-  SetCatalogKind(Kind);
-  return GetCatalogToRamfs(Directory, CatalogFileName(Kind));
+  EFI_STATUS Status = GetCatalogToRamfs(Directory, CatalogFileName(Kind));
+  if (!EFI_ERROR(Status)) {
+    PersistCatalogPath(Directory, ShareType);
+    SetCatalogKind(Kind);
+  }
+  return Status;
 }
 
-// Tries the compressed catalog, then the plain one, in SearchPath. On success
-// the catalog is completed (persisted and copied).
+// Tries the compressed catalog, then the plain one, in SearchPath. A catalog
+// found is completed (copied, then persisted). Anything but EFI_NOT_FOUND
+// means the catalog was there: its copy has decided and the search ends.
 EFI_STATUS SearchCatalog(const CHAR16 *SearchPath, UINT32 ShareType, bool AnnounceFound) {
   CHAR8 *Directory = UnicodeStrDupToAscii(SearchPath);
   if (Directory == nullptr) {
@@ -42,7 +47,7 @@ EFI_STATUS SearchCatalog(const CHAR16 *SearchPath, UINT32 ShareType, bool Announ
   DiagLog(DIAG_ALWAYS, "\nmbsCatalogPath = %a", Directory);
   UINT32 Kind = CATALOG_KIND_XML_GZ;
   EFI_STATUS Status = CheckCatalogLocation(Directory, Kind);
-  if (EFI_ERROR(Status) && Status != EFI_OUT_OF_RESOURCES) {
+  if (Status == EFI_NOT_FOUND) {
     Kind = CATALOG_KIND_XML;
     Status = CheckCatalogLocation(Directory, Kind);
   }
@@ -51,6 +56,9 @@ EFI_STATUS SearchCatalog(const CHAR16 *SearchPath, UINT32 ShareType, bool Announ
       DiagLog(DIAG_ALWAYS, "\nfound catalog file");
     }
     Status = CompleteCatalog(Directory, ShareType, Kind);
+    if (Status == EFI_NOT_FOUND) {
+      Status = EFI_DEVICE_ERROR; // found a moment ago: the copy failed
+    }
   }
   FreePool(Directory);
   return Status;
@@ -100,8 +108,8 @@ EFI_STATUS GetCatalogFromNwFS(UINT32 ShareType, const CHAR16 *CatalogDir, BOOLEA
     DiagLogW(DIAG_ALWAYS, u"\ncatalogPath = %s", SearchPath);
     Status = SearchCatalog(SearchPath, ShareType, true);
     FreePool(SearchPath);
-    if (!EFI_ERROR(Status) || Status == EFI_OUT_OF_RESOURCES) {
-      break;
+    if (Status != EFI_NOT_FOUND) {
+      break; // found, whether its copy worked or not
     }
   }
   return Status;
@@ -144,19 +152,23 @@ EFI_STATUS GetCatalogToRamfs(const CHAR8 *Directory, const CHAR8 *FileName) {
                          "GetCatalogFromLocalRepToRAMFS() \n");
     return EFI_OUT_OF_RESOURCES;
   }
-  RunSystemCommand(Command);
-  FreePool(Command);
-
+  const CHAR8 *SourceParts[] = {Directory, kSeparator, FileName};
   const CHAR8 *CheckParts[] = {kRamfsVolume, kSeparator, FileName};
+  CHAR8 *Source = JoinAscii(SourceParts);
   CHAR8 *CatalogFilePath = JoinAscii(CheckParts);
-  if (CatalogFilePath == nullptr) {
+  if (Source == nullptr || CatalogFilePath == nullptr) {
     DiagLog(DIAG_ALWAYS, "Error in memory allocation for CatalogFilePath in "
                          "GetCatalogFromLocalRepToRAMFS() \n");
+    FreePool(CatalogFilePath);
+    FreePool(Source);
+    FreePool(Command);
     return EFI_OUT_OF_RESOURCES;
   }
   DiagLog(DIAG_ALWAYS, "\n CatalogFilePath = %a", CatalogFilePath);
-  EFI_STATUS Status = ShellFileOpensAscii(CatalogFilePath) ? EFI_SUCCESS : EFI_NOT_FOUND;
+  EFI_STATUS Status = RunConfirmedCopy(Command, Source, CatalogFilePath);
   FreePool(CatalogFilePath);
+  FreePool(Source);
+  FreePool(Command);
   DiagLog(DIAG_ALWAYS, "Exiting from GetCatalogToRamfs() function\n");
   return Status;
 }

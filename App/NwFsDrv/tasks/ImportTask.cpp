@@ -28,19 +28,25 @@ void ReplaceForwardSlashes(CHAR16 *Text) {
   }
 }
 
-// One copy attempt: true when the check path opens afterwards, whatever the
-// command reported. Otherwise *Status is the runner's result when it could
-// not launch the command, else the command's own status: a copy that worked
-// but whose file lies elsewhere than the check expects stays a success, while
-// a copy that failed is reported with its failure.
-bool AttemptCopy(const CHAR16 *Command, const CHAR16 *CheckPath, EFI_STATUS *Status) {
-  INTN RunnerResult = RunShellCommand(Command);
-  if (ShellFileOpens(CheckPath)) {
-    *Status = EFI_SUCCESS;
-    return true;
+// The name a file path's file has: what follows its last separator.
+const CHAR16 *LastComponent(const CHAR16 *Path) {
+  const CHAR16 *Name = Path;
+  for (const CHAR16 *At = Path; *At != 0; At++) {
+    if (*At == u'\\' || *At == u'/') {
+      Name = At + 1;
+    }
   }
-  *Status = RunnerResult != 0 ? static_cast<EFI_STATUS>(RunnerResult) : gLastCommandStatus;
-  return false;
+  return Name;
+}
+
+// One copy attempt: true when the check path opens afterwards, which ends
+// the attempts. *CommandStatus is the runner's result when it could not
+// launch the command, else the command's own status. Whether the copy
+// counts is decided afterwards, from the sizes.
+bool AttemptCopy(const CHAR16 *Command, const CHAR16 *CheckPath, EFI_STATUS *CommandStatus) {
+  INTN RunnerResult = RunShellCommand(Command);
+  *CommandStatus = RunnerResult != 0 ? static_cast<EFI_STATUS>(RunnerResult) : gLastCommandStatus;
+  return ShellFileOpens(CheckPath);
 }
 
 // The import echoes the map command and reports a failed one with its status.
@@ -74,12 +80,21 @@ EFI_STATUS GetFileFromNWFS(UINT32 ShareType, const CHAR16 *FilePath, const CHAR1
   PrintCopyCommand(Identifier, FilePath, DestPath, Command);
 
   // The check keeps the file path's directories: it finds the copy only when
-  // they exist under the destination too.
+  // they exist under the destination too. The copy itself lands under the
+  // file's own name in the destination, and must bring as many bytes as the
+  // file has on the share.
   const CHAR16 *CheckParts[] = {DestPath, FilePath};
   CHAR16 *CheckPath = JoinText(CheckParts);
   CHAR8 *CheckPath8 = CheckPath != nullptr ? UnicodeStrDupToAscii(CheckPath) : nullptr;
-  if (CheckPath8 == nullptr) {
+  const CHAR16 *SourceParts[] = {Identifier, u":\\", FilePath};
+  CHAR16 *Source = JoinText(SourceParts);
+  const CHAR16 *TargetParts[] = {DestPath, LastComponent(FilePath)};
+  CHAR16 *Target = JoinText(TargetParts);
+  if (CheckPath8 == nullptr || Source == nullptr || Target == nullptr) {
     DiagLog(DIAG_ALWAYS, "\n Memory allocation error for Command \n");
+    FreePool(Target);
+    FreePool(Source);
+    FreePool(CheckPath8);
     FreePool(CheckPath);
     FreePool(Command);
     return EFI_OUT_OF_RESOURCES;
@@ -87,16 +102,23 @@ EFI_STATUS GetFileFromNWFS(UINT32 ShareType, const CHAR16 *FilePath, const CHAR1
   DiagLog(DIAG_ALWAYS, "\n (%d)fileCheck = [%ls]\n", __LINE__, CheckPath);
   DiagLog(DIAG_ALWAYS, "\n fileCheck8 = [%s]\n", CheckPath8);
 
-  if (!AttemptCopy(Command, CheckPath, &Status)) {
+  ReplaceForwardSlashes(Source);
+  UINT64 SourceSize = 0;
+  bool SourceFound = ShellFileSize(Source, &SourceSize);
+  EFI_STATUS CommandStatus = EFI_SUCCESS;
+  if (!AttemptCopy(Command, CheckPath, &CommandStatus)) {
     // A path written with '/' that the shell could not resolve: once more
     // with every '/' turned into '\'.
     ReplaceForwardSlashes(Command);
     PrintCopyCommand(Identifier, FilePath, DestPath, Command);
-    if (!AttemptCopy(Command, CheckPath, &Status)) {
+    if (!AttemptCopy(Command, CheckPath, &CommandStatus)) {
       DiagLogW(DIAG_ALWAYS, u"GetFileFromNWFS(): command failed, %s\n", Command);
     }
   }
+  Status = ConfirmCopy(SourceFound, SourceSize, CommandStatus, Target);
   PrintCommandStatus(Status);
+  FreePool(Target);
+  FreePool(Source);
   FreePool(CheckPath8);
   FreePool(CheckPath);
   FreePool(Command);
@@ -113,12 +135,19 @@ EFI_STATUS CopyCatalogSignatureToRamfs() {
   Record.CifsCatalogPath[PROVISIONING_TEXT_BYTES - 1] = 0;
   const CHAR8 *Parts[] = {"cp -q ",  Record.CifsCatalogPath, "\\", kSignatureFileName, " ",
                           "ramfs:\\"};
+  const CHAR8 *SourceParts[] = {Record.CifsCatalogPath, "\\", kSignatureFileName};
+  const CHAR8 *TargetParts[] = {"ramfs:\\", kSignatureFileName};
   CHAR8 *Command = JoinAscii(Parts);
-  if (Command == nullptr) {
+  CHAR8 *Source = JoinAscii(SourceParts);
+  CHAR8 *Target = JoinAscii(TargetParts);
+  EFI_STATUS Status = EFI_OUT_OF_RESOURCES;
+  if (Command == nullptr || Source == nullptr || Target == nullptr) {
     DiagLog(DIAG_ALWAYS, "\nfailed to allocate memory for command");
-    return EFI_OUT_OF_RESOURCES;
+  } else {
+    Status = RunConfirmedCopy(Command, Source, Target);
   }
-  EFI_STATUS Status = RunSystemCommand(Command);
+  FreePool(Target);
+  FreePool(Source);
   FreePool(Command);
   return Status;
 }

@@ -71,13 +71,25 @@ void PrintCommandStatus(EFI_STATUS Status, UINT32 Line) {
   DiagLog(DIAG_ALWAYS, "\n (%d)Status = [%d]\n", Line, static_cast<INT32>(Status));
 }
 
-bool ShellFileOpens(const CHAR16 *Path) {
-  EFI_SHELL_PROTOCOL *Shell = CurrentShell();
-  if (Path == nullptr || Shell == nullptr || Shell->OpenFileByName == nullptr) {
-    return false;
-  }
+namespace {
+
+// Path opened for reading through the shell, or null.
+SHELL_FILE_HANDLE OpenThroughShell(const CHAR16 *Path, EFI_SHELL_PROTOCOL **Shell) {
+  *Shell = CurrentShell();
   SHELL_FILE_HANDLE File = nullptr;
-  if (Shell->OpenFileByName(Path, &File, EFI_FILE_MODE_READ) != EFI_SUCCESS || File == nullptr) {
+  if (Path == nullptr || *Shell == nullptr || (*Shell)->OpenFileByName == nullptr ||
+      (*Shell)->OpenFileByName(Path, &File, EFI_FILE_MODE_READ) != EFI_SUCCESS) {
+    return nullptr;
+  }
+  return File;
+}
+
+} // namespace
+
+bool ShellFileOpens(const CHAR16 *Path) {
+  EFI_SHELL_PROTOCOL *Shell = nullptr;
+  SHELL_FILE_HANDLE File = OpenThroughShell(Path, &Shell);
+  if (File == nullptr) {
     return false;
   }
   Shell->CloseFile(File);
@@ -89,6 +101,66 @@ bool ShellFileOpensAscii(const CHAR8 *Path) {
   bool Opens = Wide != nullptr && ShellFileOpens(Wide);
   FreePool(Wide);
   return Opens;
+}
+
+bool ShellFileSize(const CHAR16 *Path, UINT64 *Size) {
+  EFI_SHELL_PROTOCOL *Shell = nullptr;
+  SHELL_FILE_HANDLE File = OpenThroughShell(Path, &Shell);
+  if (File == nullptr) {
+    return false;
+  }
+  EFI_FILE_INFO *Info = Shell->GetFileInfo(File);
+  Shell->CloseFile(File);
+  if (Info == nullptr) {
+    return false;
+  }
+  *Size = Info->FileSize;
+  FreePool(Info);
+  return true;
+}
+
+// ---------------------------------------------------------------------------
+// Copies that must arrive whole
+// ---------------------------------------------------------------------------
+
+EFI_STATUS ConfirmCopy(bool SourceFound, UINT64 SourceSize, EFI_STATUS CommandStatus,
+                       const CHAR16 *Destination) {
+  if (!SourceFound) {
+    return EFI_NOT_FOUND;
+  }
+  UINT64 Arrived = 0;
+  bool Present = ShellFileSize(Destination, &Arrived);
+  if (!EFI_ERROR(CommandStatus) && Present && Arrived == SourceSize) {
+    return EFI_SUCCESS;
+  }
+  // A copy that broke off leaves a short file behind: it must not pass for
+  // the file.
+  DiagLog(DIAG_ALWAYS, "\nCopy to %ls failed (%ld of %ld bytes, status 0x%x)\n", Destination,
+          Arrived, SourceSize, static_cast<UINT32>(CommandStatus));
+  if (Present) {
+    const CHAR16 *Parts[] = {u"del -q ", Destination};
+    CHAR16 *Command = JoinText(Parts);
+    if (Command != nullptr) {
+      RunSystemCommandW(Command);
+      FreePool(Command);
+    }
+  }
+  return EFI_DEVICE_ERROR;
+}
+
+EFI_STATUS RunConfirmedCopy(const CHAR8 *CommandLine, const CHAR8 *Source,
+                            const CHAR8 *Destination) {
+  CHAR16 *WideSource = AsciiStrDupToUnicode(Source);
+  CHAR16 *WideDestination = AsciiStrDupToUnicode(Destination);
+  EFI_STATUS Status = EFI_OUT_OF_RESOURCES;
+  if (WideSource != nullptr && WideDestination != nullptr) {
+    UINT64 SourceSize = 0;
+    bool SourceFound = ShellFileSize(WideSource, &SourceSize);
+    Status = ConfirmCopy(SourceFound, SourceSize, RunSystemCommand(CommandLine), WideDestination);
+  }
+  FreePool(WideSource);
+  FreePool(WideDestination);
+  return Status;
 }
 
 // ---------------------------------------------------------------------------

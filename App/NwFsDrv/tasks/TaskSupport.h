@@ -31,3 +31,20 @@ void PrintCommandStatus(EFI_STATUS Status, UINT32 Line = __builtin_LINE());
 // again at once.
 bool ShellFileOpens(const CHAR16 *Path);
 bool ShellFileOpensAscii(const CHAR8 *Path);
+
+// The size of the file at Path, from its EFI_FILE_INFO through the shell.
+// False when it does not open.
+bool ShellFileSize(const CHAR16 *Path, UINT64 *Size);
+
+// A copy from the share counts only when it arrived whole. SourceFound and
+// SourceSize are the source as measured before the copy ran. The verdict:
+// EFI_NOT_FOUND when there was no source; success when the copy command
+// succeeded and Destination holds exactly SourceSize bytes; otherwise
+// EFI_DEVICE_ERROR, and whatever the copy left at Destination is deleted
+// through the shell.
+EFI_STATUS ConfirmCopy(bool SourceFound, UINT64 SourceSize, EFI_STATUS CommandStatus,
+                       const CHAR16 *Destination);
+// Measures Source, runs the 8-bit copy command line through the shell and
+// confirms the copy into Destination as above.
+EFI_STATUS RunConfirmedCopy(const CHAR8 *CommandLine, const CHAR8 *Source,
+                            const CHAR8 *Destination);

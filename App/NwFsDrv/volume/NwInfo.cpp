@@ -74,9 +74,26 @@ EFI_STATUS SetVolumeLabel(NW_VOLUME *Volume, UINTN BufferSize, const CHAR16 *Lab
   return EFI_SUCCESS;
 }
 
+// "", "." and ".." name the directory the file is in or one above it, never a
+// new name for the file: a rename to one of them does nothing.
+bool NamesNoEntry(const CHAR16 *Name) {
+  return Name[0] == 0 || StrCmp(Name, u".") == 0 || StrCmp(Name, u"..") == 0;
+}
+
+bool IsAncestor(const NW_OPEN_FILE *Candidate, const NW_OPEN_FILE *OpenFile) {
+  for (const NW_OPEN_FILE *Up = OpenFile->Parent; Up != nullptr; Up = Up->Parent) {
+    if (Up == Candidate) {
+      return true;
+    }
+  }
+  return false;
+}
+
 // Moves Handle from its record to the record of NewName (opened, or created,
 // next to it, with no attribute but the directory bit of the old record). The
-// rename stays local: the share is not asked to rename.
+// rename stays local: the share is not asked to rename. A directory's record
+// is never taken over: a name that leads to a directory above the file
+// changes nothing, and a file is not renamed onto another directory.
 EFI_STATUS RenameLocally(NW_FILE_HANDLE *Handle, const CHAR16 *NewName) {
   NW_OPEN_FILE *Old = Handle->OpenFile;
   NW_FILE_HANDLE Anchor;
@@ -91,10 +108,12 @@ EFI_STATUS RenameLocally(NW_FILE_HANDLE *Handle, const CHAR16 *NewName) {
   }
   NW_VOLUME *Volume = Old->Volume;
   NW_OPEN_FILE *New = Temporary->OpenFile;
-  if (New == Old) {
+  bool Above = New->ROOTDIR != 0 || IsAncestor(New, Old);
+  bool FileOntoDirectory = !NwIsDirectory(Old) && NwIsDirectory(New);
+  if (New == Old || Above || FileOntoDirectory) {
     New->HandleCount--;
     FreeFileHandle(Volume, Temporary);
-    return EFI_SUCCESS;
+    return FileOntoDirectory && !Above ? EFI_ACCESS_DENIED : EFI_SUCCESS;
   }
   New->DirectoryEntry = Old->DirectoryEntry;
   // The temporary handle's remote file is not used: close it again.
@@ -139,7 +158,8 @@ EFI_STATUS SetFileInfo(NW_FILE_HANDLE *Handle, UINTN BufferSize, const EFI_FILE_
     return EFI_INVALID_PARAMETER;
   }
   bool SizeChanges = Info->FileSize != OpenFile->DirectoryEntry.FileSize;
-  bool NameChanges = !NwNamesEqual(Info->FileName, OpenFile->FileName);
+  bool NameChanges =
+      !NwNamesEqual(Info->FileName, OpenFile->FileName) && !NamesNoEntry(Info->FileName);
   if (NwIsDirectory(OpenFile) && SizeChanges) {
     return EFI_ACCESS_DENIED;
   }

@@ -76,7 +76,9 @@ UINT32 NwParseDecimal(const CHAR16 *Text) {
   }
   CHAR8 Narrow[kNumberChars];
   UnicodeStrToAsciiS(Text, Narrow, kNumberChars);
-  return static_cast<UINT32>(AsciiStrDecimalToInt(Narrow));
+  UINT32 Value = static_cast<UINT32>(AsciiStrDecimalToInt(Narrow));
+  ZeroMem(Narrow, sizeof(Narrow)); // the text may be a password argument
+  return Value;
 }
 
 EFI_STATUS DetectInstallVolume(EFI_HANDLE Handle, const CHAR8 *Language, NW_SHARE_INFO *ShareInfo,
@@ -132,7 +134,7 @@ EFI_STATUS RemoveInstalledVolume(NW_VOLUME *Volume) {
   if (Volume->ConnectionInfo != nullptr) {
     FreePool(Volume->ConnectionInfo->ipAddress);
     FreePool(Volume->ConnectionInfo->username);
-    FreePool(Volume->ConnectionInfo->password);
+    FreeClearedStr(Volume->ConnectionInfo->password);
     FreePool(Volume->ConnectionInfo);
   }
   FreePool(Volume->ControllerName);

@@ -305,6 +305,9 @@ EFI_STATUS OpenVolumeRoot(NW_VOLUME *Volume, NW_FILE_HANDLE **Root, EFI_FILE_SYS
   EFI_STATUS Status = QueryFsInfo(Volume, Stats);
   if (Status != EFI_SUCCESS) {
     DiagError("GEE_NWGetFSInfo failed!", Status);
+    if (Volume->Root == nullptr) {
+      Volume->VolumeStatus = EFI_DEVICE_ERROR; // the root could not be opened
+    }
     return EFI_DEVICE_ERROR;
   }
   if (Volume->Root == nullptr) {

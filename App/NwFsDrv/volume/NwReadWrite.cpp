@@ -91,7 +91,12 @@ EFI_STATUS ReadChunks(NW_FILE_HANDLE *Handle, ReadState *State) {
     if (!EFI_ERROR(Status) && ReadCount > State->Wanted) {
       Status = EFI_DEVICE_ERROR; // more than was asked for: never trusted
     }
-    if (EFI_ERROR(Status) || ReadCount == 0) {
+    if (!EFI_ERROR(Status) && ReadCount == 0) {
+      // Bytes are still due before the size the file's entry gives: a read
+      // that brings nothing is a failure, never the end of the file.
+      Status = EFI_DEVICE_ERROR;
+    }
+    if (EFI_ERROR(Status)) {
       DiagError("GEE_NWFRead failed!", Status);
       DiagLog(DIAG_ALWAYS, "readCount = %ld\n", ReadCount);
       break;
@@ -151,7 +156,8 @@ EFI_STATUS ReadFile(NW_FILE_HANDLE *Handle, UINTN *BufferSize, void *Buffer) {
 }
 
 // One write request at the process-wide offset, which advances by what the
-// request reports, failed or not.
+// request reports, failed or not. A request that reports fewer bytes than it
+// was given failed: the file on the share would be short.
 EFI_STATUS WriteAtOffset(NW_FILE_HANDLE *Handle, const UINT8 *Data, UINT64 *Length) {
   UINT64 Asked = *Length;
   EFI_STATUS Status = GEE_NWFWrite(Handle->OpenFile->Volume->shareInfo, &Handle->shareFileInfo,
@@ -159,6 +165,10 @@ EFI_STATUS WriteAtOffset(NW_FILE_HANDLE *Handle, const UINT8 *Data, UINT64 *Leng
   if (*Length > Asked) {
     *Length = Asked;
     Status = EFI_ERROR(Status) ? Status : EFI_DEVICE_ERROR;
+  }
+  if (!EFI_ERROR(Status) && *Length < Asked) {
+    DiagError("GEE_NWFWrite wrote fewer bytes than asked!", EFI_DEVICE_ERROR);
+    Status = EFI_DEVICE_ERROR;
   }
   gWriteOffset += *Length;
   return Status;
@@ -219,9 +229,6 @@ EFI_STATUS EFIAPI WriteFileHandle(EFI_FILE_PROTOCOL *This, UINTN *BufferSize, vo
         DiagLog(DIAG_ALWAYS, "WriteFileHandle: WriteDatalen=%lld offset=%lld\n", Chunk,
                 gWriteOffset);
         Status = WriteAtOffset(Handle, Source + Total, &Chunk);
-        if (!EFI_ERROR(Status) && Chunk == 0) {
-          Status = EFI_DEVICE_ERROR; // no progress: the loop would never end
-        }
         if (EFI_ERROR(Status)) {
           break;
         }
