@@ -125,18 +125,18 @@ bool ShellFileSize(const CHAR16 *Path, UINT64 *Size) {
 
 EFI_STATUS ConfirmCopy(bool SourceFound, UINT64 SourceSize, EFI_STATUS CommandStatus,
                        const CHAR16 *Destination) {
-  if (!SourceFound) {
-    return EFI_NOT_FOUND;
-  }
   UINT64 Arrived = 0;
   bool Present = ShellFileSize(Destination, &Arrived);
-  if (!EFI_ERROR(CommandStatus) && Present && Arrived == SourceSize) {
+  if (SourceFound && !EFI_ERROR(CommandStatus) && Present && Arrived == SourceSize) {
     return EFI_SUCCESS;
   }
-  // A copy that broke off leaves a short file behind: it must not pass for
-  // the file.
-  DiagLog(DIAG_ALWAYS, "\nCopy to %ls failed (%ld of %ld bytes, status 0x%x)\n", Destination,
-          Arrived, SourceSize, static_cast<UINT32>(CommandStatus));
+  // A copy that broke off leaves a short file behind, and one whose source
+  // could not be found an empty one (the copy command makes the destination
+  // first): nothing a failed copy left may pass for the file.
+  if (SourceFound) {
+    DiagLog(DIAG_ALWAYS, "\nCopy to %ls failed (%ld of %ld bytes, status 0x%x)\n", Destination,
+            Arrived, SourceSize, static_cast<UINT32>(CommandStatus));
+  }
   if (Present) {
     const CHAR16 *Parts[] = {u"del -q ", Destination};
     CHAR16 *Command = JoinText(Parts);
@@ -145,7 +145,7 @@ EFI_STATUS ConfirmCopy(bool SourceFound, UINT64 SourceSize, EFI_STATUS CommandSt
       FreePool(Command);
     }
   }
-  return EFI_DEVICE_ERROR;
+  return SourceFound ? EFI_DEVICE_ERROR : EFI_NOT_FOUND;
 }
 
 EFI_STATUS RunConfirmedCopy(const CHAR8 *CommandLine, const CHAR8 *Source,

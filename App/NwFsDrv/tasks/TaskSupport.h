@@ -38,10 +38,10 @@ bool ShellFileSize(const CHAR16 *Path, UINT64 *Size);
 
 // A copy from the share counts only when it arrived whole. SourceFound and
 // SourceSize are the source as measured before the copy ran. The verdict:
-// EFI_NOT_FOUND when there was no source; success when the copy command
-// succeeded and Destination holds exactly SourceSize bytes; otherwise
-// EFI_DEVICE_ERROR, and whatever the copy left at Destination is deleted
-// through the shell.
+// Success when the source was found, the copy command succeeded and
+// Destination holds exactly SourceSize bytes; otherwise EFI_NOT_FOUND when
+// there was no source and EFI_DEVICE_ERROR when there was, and whatever the
+// copy left at Destination is deleted through the shell.
 EFI_STATUS ConfirmCopy(bool SourceFound, UINT64 SourceSize, EFI_STATUS CommandStatus,
                        const CHAR16 *Destination);
 // Measures Source, runs the 8-bit copy command line through the shell and
