@@ -1,7 +1,6 @@
 // SMB2 framing and the transport underneath it: per-command header fields
-// and credit charges, the NT-code mapping, the builders' and connect
-// parameters' limits, address parsing, and the read-all loop against a peer
-// that stops sending.
+// and credit charges, the builders' and connect parameters' limits, address
+// parsing, and the read-all loop against a peer that stops sending.
 #include "MockSmbServer.h"
 #include "Smb2TestEnv.h"
 #include "smb2/SMB2Connect.h"
@@ -58,31 +57,16 @@ TEST_F(Smb2FramingTest, PerCommandHeaderFieldsAndCreditCharges) {
   }
   // READ and WRITE: one credit per started 64 KiB, 32-bit arithmetic
   // stored in 16 bits; nothing on dialect 0x0202.
-  EXPECT_EQ(SMB2CreditCharge(SMB2_READ, 65536, SMB2_DIALECT_210), 1);
-  EXPECT_EQ(SMB2CreditCharge(SMB2_READ, 65537, SMB2_DIALECT_210), 2);
-  EXPECT_EQ(SMB2CreditCharge(SMB2_WRITE, 64512, SMB2_DIALECT_210), 1);
-  EXPECT_EQ(SMB2CreditCharge(SMB2_WRITE, 0, SMB2_DIALECT_210), 0);
-  EXPECT_EQ(SMB2CreditCharge(SMB2_READ, 65537, SMB2_DIALECT_202), 0);
-  EXPECT_EQ(SMB2CreditCharge(SMB2_QUERY_INFO, 0, SMB2_DIALECT_202), 0);
-}
-
-TEST_F(Smb2FramingTest, NtCodeMapping) {
-  struct Case {
-    UINT32 Code;
-    EFI_STATUS Status;
-    const char *Printed;
-  } Cases[] = {
-      {0, EFI_SUCCESS, ""},
-      {0xC0000001, EFI_DEVICE_ERROR,
-       "Function: F, Line no.: = 7, X returned unsuccessful! Status = 0xc0000001\n"},
-      {0x80070057, EFI_INVALID_PARAMETER,
-       "Function: F, Line no.: = 7, X returned invalid parameter! Status = 0x80070057\n"},
-      {0xC0000017, EFI_DEVICE_ERROR,
-       "Function: F, Line no.: = 7, X returned error! Status = 0xc0000017\n"},
-  };
-  for (const Case &C : Cases) {
-    EXPECT_EQ(Console([&] { EXPECT_EQ(SMB2MapNtStatus(C.Code, "X", "F", 7), C.Status); }),
-              C.Printed);
+  struct Charge {
+    UINT16 Command;
+    UINT32 Length;
+    UINT16 Dialect, Expected;
+  } Charges[] = {
+      {SMB2_READ, 65536, SMB2_DIALECT_210, 1},  {SMB2_READ, 65537, SMB2_DIALECT_210, 2},
+      {SMB2_WRITE, 64512, SMB2_DIALECT_210, 1}, {SMB2_WRITE, 0, SMB2_DIALECT_210, 0},
+      {SMB2_READ, 65537, SMB2_DIALECT_202, 0},  {SMB2_QUERY_INFO, 0, SMB2_DIALECT_202, 0}};
+  for (const Charge &C : Charges) {
+    EXPECT_EQ(SMB2CreditCharge(C.Command, C.Length, C.Dialect), C.Expected) << C.Length;
   }
 }
 
