@@ -58,13 +58,6 @@ e2e_out_lacks() {
   [[ "$E2E_OUT" != *"$1"* ]]
 }
 
-# The console text of the last run holds the line LINE exactly COUNT times.
-e2e_line_count() {
-  local found
-  found=$(printf '%s\n' "$E2E_OUT" | grep -cFx -- "$1")
-  [[ "$found" == "$2" ]]
-}
-
 # Prints "ATTRIBUTES DATA" of a variable in the store, nothing when absent.
 e2e_var() {
   local guid=$1 name=$2
@@ -72,27 +65,11 @@ e2e_var() {
   awk -v g="{$guid}" -v n="$name" '$1 == g && $2 == n { print $3, $4 }' "$CIFSDRV_VARSTORE"
 }
 
-# The variable exists with ATTRIBUTES and SIZE bytes of data.
-e2e_var_shape() {
-  local value attributes data
-  value=$(e2e_var "$1" "$2")
-  [[ -n "$value" ]] || return 1
-  read -r attributes data <<<"$value"
-  [[ "$((16#$attributes))" == "$3" && "${#data}" == "$(($4 * 2))" ]]
-}
-
 # The variable's data starts with the hex bytes PREFIX.
 e2e_var_starts() {
   local value
   value=$(e2e_var "$1" "$2")
   [[ "${value#* }" == "$3"* ]]
-}
-
-# The variable's first data byte is not zero.
-e2e_var_first_byte_nonzero() {
-  local value
-  value=$(e2e_var "$1" "$2")
-  [[ -n "$value" && "${value#* }" != 00* ]]
 }
 
 e2e_finish() {

@@ -156,18 +156,6 @@ TEST_F(DebugLevelTest, Smb2Level) {
   }
 }
 
-TEST_F(DebugLevelTest, NoRuntimeServices) {
-  gRT = nullptr;
-  gSMB2DebugLevel = 4;
-  UINT8 Driver = 3;
-  UINT8 Smb2 = 3;
-  EXPECT_EQ(QVUIkestDebugLevelInitialize(&Driver), EFI_INVALID_PARAMETER);
-  EXPECT_EQ(SMB2DebugLevelInitialize(&Smb2), EFI_INVALID_PARAMETER);
-  EXPECT_EQ(Driver, 0);
-  EXPECT_EQ(Smb2, 0);
-  EXPECT_EQ(Console(), "RT variable is NULL!\nRT variable is NULL!\n");
-}
-
 TEST_F(DiagLogTest, StandardLines) {
   static_assert(DiagStatusNumber(EFI_NOT_FOUND) == 14 && DiagStatusValue(EFI_NOT_FOUND) == 0xe);
   static_assert(DiagStatusNumber(EFI_SUCCESS) == 0 && DiagStatusValue(EFI_SUCCESS) == 0);
@@ -221,29 +209,6 @@ TEST_F(DiagLogTest, EachChannelHasItsOwnLevel) {
   gDriverDebugLevel = 0;
   DiagError("e", EFI_ABORTED, "g", 2); // error lines print whatever the level
   EXPECT_EQ(Console(), "abcdFunction: g, Line no.: = 2 - e, Status = 21 (0x15)\n");
-}
-
-TEST_F(DiagLogTest, WideFormatsLongLinesAndNoConsole) {
-  gDriverDebugLevel = 5;
-  DiagLogW(DIAG_VERBOSE, u"driveName = %s, %a\n", u"fs0\u00e9", "x");
-  EXPECT_EQ(gConsoleText, u"driveName = fs0\u00e9, x\n");
-
-  // A long line arrives whole, unchanged (no CR added), in a few writes.
-  gConsoleText.clear();
-  gConsoleCalls = 0;
-  const std::string Long(2000, 'q');
-  DiagLog(DIAG_ALWAYS, "<%s>\n", Long.c_str());
-  EXPECT_EQ(Console(), "<" + Long + ">\n");
-  EXPECT_GE(gConsoleCalls, 2);
-  EXPECT_LE(gConsoleCalls, 10);
-
-  gConsoleCalls = 0;
-  System.ConOut = nullptr;
-  DiagLog(DIAG_ALWAYS, "x");
-  DiagError("x", EFI_ABORTED, "f", 1);
-  gST = nullptr;
-  DiagLogW(DIAG_ALWAYS, u"x");
-  EXPECT_EQ(gConsoleCalls, 0);
 }
 
 } // namespace

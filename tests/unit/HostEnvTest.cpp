@@ -1,6 +1,6 @@
 // The hosted UEFI environment seen through its tables, the way the image sees
 // it: the counted pool, events and timers under TPL rules, the handle
-// database and driver model, the variable store file and Unicode Collation.
+// database, the variable store file and Unicode Collation.
 #include "HostImageFixture.h"
 
 #include <gtest/gtest.h>
@@ -78,14 +78,6 @@ void EFIAPI CountNotify(EFI_EVENT, void *Context) {
   Log->Bs->RestoreTPL(Log->TplSeen);
 }
 
-// Like the keep-alive: cancels itself and re-arms for later.
-void EFIAPI RearmNotify(EFI_EVENT Event, void *Context) {
-  NotifyLog *Log = static_cast<NotifyLog *>(Context);
-  Log->Count++;
-  Log->Bs->SetTimer(Event, TimerCancel, 0);
-  Log->Bs->SetTimer(Event, TimerRelative, 100000); // 10 ms
-}
-
 TEST_F(HostEnv, RelativeTimerNotifiesOnceInsideStallAtItsOwnLevel) {
   NotifyLog Log;
   Log.Bs = Bs;
@@ -101,31 +93,6 @@ TEST_F(HostEnv, RelativeTimerNotifiesOnceInsideStallAtItsOwnLevel) {
   EXPECT_EQ(Log.Count, 1);
   EXPECT_EQ(Bs->CloseEvent(Timer), EFI_SUCCESS);
   EXPECT_EQ(Bs->CloseEvent(Timer), EFI_INVALID_PARAMETER);
-}
-
-TEST_F(HostEnv, PeriodicTimerAndSelfRearmingTimerKeepFiring) {
-  NotifyLog Periodic, Rearm;
-  Periodic.Bs = Rearm.Bs = Bs;
-  EFI_EVENT P = nullptr;
-  EFI_EVENT R = nullptr;
-  ASSERT_EQ(
-      Bs->CreateEvent(EVT_TIMER | EVT_NOTIFY_SIGNAL, TPL_CALLBACK, CountNotify, &Periodic, &P),
-      EFI_SUCCESS);
-  ASSERT_EQ(Bs->CreateEvent(EVT_TIMER | EVT_NOTIFY_SIGNAL, TPL_CALLBACK, RearmNotify, &Rearm, &R),
-            EFI_SUCCESS);
-  Bs->SetTimer(P, TimerPeriodic, 100000);
-  Bs->SetTimer(R, TimerRelative, 100000);
-  Bs->Stall(65000);
-  // Missed periods are not made up, so a loaded machine may see fewer.
-  EXPECT_GE(Periodic.Count, 2);
-  EXPECT_LE(Periodic.Count, 6);
-  EXPECT_GE(Rearm.Count, 2);
-  Bs->SetTimer(P, TimerCancel, 0);
-  int Frozen = Periodic.Count;
-  Bs->Stall(25000);
-  EXPECT_EQ(Periodic.Count, Frozen);
-  Bs->CloseEvent(P);
-  Bs->CloseEvent(R);
 }
 
 TEST_F(HostEnv, RaisedTplHoldsNotificationsUntilRestore) {
@@ -203,119 +170,6 @@ TEST_F(HostEnv, HandlesAreListedInCreationOrderAndVanishWithTheirLastProtocol) {
   Bs->UninstallProtocolInterface(H2, &kGuidB, &Ib);
   Bs->UninstallProtocolInterface(H3, &kGuidA, &Ic);
   EXPECT_TRUE(HandlesWith(Bs, kGuidA).empty());
-}
-
-TEST_F(HostEnv, InstallMultipleIsAllOrNothing) {
-  int Ia = 1, Ib = 2;
-  // A GUID twice in one call fails on the second and takes the first back.
-  EFI_HANDLE Fresh = nullptr;
-  EXPECT_EQ(Bs->InstallMultipleProtocolInterfaces(&Fresh, &kGuidA, &Ia, &kGuidB, &Ib, &kGuidA, &Ia,
-                                                  nullptr),
-            EFI_INVALID_PARAMETER);
-  EXPECT_EQ(Fresh, nullptr);
-  EXPECT_TRUE(HandlesWith(Bs, kGuidA).empty());
-  EXPECT_TRUE(HandlesWith(Bs, kGuidB).empty());
-
-  EFI_HANDLE H = nullptr;
-  ASSERT_EQ(Bs->InstallMultipleProtocolInterfaces(&H, &kGuidA, &Ia, nullptr), EFI_SUCCESS);
-  EXPECT_EQ(Bs->InstallMultipleProtocolInterfaces(&H, &kGuidB, &Ib, &kGuidA, &Ia, nullptr),
-            EFI_INVALID_PARAMETER);
-  EXPECT_TRUE(HandlesWith(Bs, kGuidB).empty());
-
-  // Uninstall: one wrong interface puts the others back.
-  ASSERT_EQ(Bs->InstallMultipleProtocolInterfaces(&H, &kGuidB, &Ib, nullptr), EFI_SUCCESS);
-  EXPECT_EQ(Bs->UninstallMultipleProtocolInterfaces(H, &kGuidA, &Ia, &kGuidB, &Ia, nullptr),
-            EFI_INVALID_PARAMETER);
-  EXPECT_EQ(HandlesWith(Bs, kGuidA), std::vector<EFI_HANDLE>{H});
-  EXPECT_EQ(Bs->UninstallMultipleProtocolInterfaces(H, &kGuidA, &Ia, &kGuidB, &Ib, nullptr),
-            EFI_SUCCESS);
-  EXPECT_TRUE(HandlesWith(Bs, kGuidA).empty());
-}
-
-// A driver that takes kGuidA on a controller by driver and lets go in Stop.
-struct FakeDriver {
-  EFI_DRIVER_BINDING_PROTOCOL Binding; // first: the interface is the record
-  EFI_BOOT_SERVICES *Bs;
-  int Started, Stopped;
-  bool CloseOnStop;
-};
-
-EFI_STATUS EFIAPI FakeSupported(EFI_DRIVER_BINDING_PROTOCOL *This, EFI_HANDLE Controller,
-                                EFI_DEVICE_PATH_PROTOCOL *) {
-  FakeDriver *D = reinterpret_cast<FakeDriver *>(This);
-  return D->Bs->OpenProtocol(Controller, &kGuidA, nullptr, This->DriverBindingHandle, Controller,
-                             EFI_OPEN_PROTOCOL_TEST_PROTOCOL);
-}
-
-EFI_STATUS EFIAPI FakeStart(EFI_DRIVER_BINDING_PROTOCOL *This, EFI_HANDLE Controller,
-                            EFI_DEVICE_PATH_PROTOCOL *) {
-  FakeDriver *D = reinterpret_cast<FakeDriver *>(This);
-  void *Interface = nullptr;
-  EFI_STATUS Status =
-      D->Bs->OpenProtocol(Controller, &kGuidA, &Interface, This->DriverBindingHandle, Controller,
-                          EFI_OPEN_PROTOCOL_BY_DRIVER);
-  D->Started += Status == EFI_SUCCESS;
-  return Status;
-}
-
-EFI_STATUS EFIAPI FakeStop(EFI_DRIVER_BINDING_PROTOCOL *This, EFI_HANDLE Controller, UINTN,
-                           EFI_HANDLE *) {
-  FakeDriver *D = reinterpret_cast<FakeDriver *>(This);
-  D->Stopped++;
-  if (D->CloseOnStop) {
-    D->Bs->CloseProtocol(Controller, &kGuidA, This->DriverBindingHandle, Controller);
-  }
-  return EFI_SUCCESS;
-}
-
-FakeDriver MakeDriver(EFI_BOOT_SERVICES *Bs) {
-  return FakeDriver{{FakeSupported, FakeStart, FakeStop, 0x10, nullptr, nullptr}, Bs, 0, 0, true};
-}
-
-void InstallDriver(EFI_BOOT_SERVICES *Bs, FakeDriver &D, EFI_HANDLE *Handle) {
-  ASSERT_EQ(Bs->InstallProtocolInterface(Handle, &gEfiDriverBindingProtocolGuid,
-                                         EFI_NATIVE_INTERFACE, &D.Binding),
-            EFI_SUCCESS);
-  D.Binding.ImageHandle = D.Binding.DriverBindingHandle = *Handle;
-}
-
-TEST_F(HostEnv, ConnectStartsSupportingDriversAndDisconnectStopsThem) {
-  int Ia = 1;
-  EFI_HANDLE Controller = nullptr, Bare = nullptr, Driver1 = nullptr, Driver2 = nullptr;
-  ASSERT_EQ(Bs->InstallProtocolInterface(&Controller, &kGuidA, EFI_NATIVE_INTERFACE, &Ia),
-            EFI_SUCCESS);
-  ASSERT_EQ(Bs->InstallProtocolInterface(&Bare, &kGuidB, EFI_NATIVE_INTERFACE, &Ia), EFI_SUCCESS);
-  FakeDriver D1 = MakeDriver(Bs), D2 = MakeDriver(Bs);
-  InstallDriver(Bs, D1, &Driver1);
-  InstallDriver(Bs, D2, &Driver2);
-
-  EXPECT_EQ(Bs->ConnectController(Bare, nullptr, nullptr, FALSE), EFI_NOT_FOUND);
-  EXPECT_EQ(Bs->ConnectController(Controller, nullptr, nullptr, FALSE), EFI_SUCCESS);
-  EXPECT_EQ(D1.Started + D2.Started, 1); // the first driver holds it by driver
-
-  // Nothing to stop is success; a foreign driver filter stops nobody.
-  EXPECT_EQ(Bs->DisconnectController(Bare, nullptr, nullptr), EFI_SUCCESS);
-  EFI_HANDLE Holder = D1.Started ? Driver1 : Driver2;
-  EFI_HANDLE Idle = D1.Started ? Driver2 : Driver1;
-  EXPECT_EQ(Bs->DisconnectController(Controller, Idle, nullptr), EFI_SUCCESS);
-  EXPECT_EQ(D1.Stopped + D2.Stopped, 0);
-  EXPECT_EQ(Bs->DisconnectController(Controller, Holder, nullptr), EFI_SUCCESS);
-  EXPECT_EQ(D1.Stopped + D2.Stopped, 1);
-
-  // Uninstalling a protocol held by driver asks the driver to stop first;
-  // a driver that does not let go makes the uninstall fail.
-  EFI_HANDLE Only[2] = {Driver1, nullptr};
-  ASSERT_EQ(Bs->ConnectController(Controller, Only, nullptr, FALSE), EFI_SUCCESS);
-  D1.CloseOnStop = false;
-  EXPECT_EQ(Bs->UninstallProtocolInterface(Controller, &kGuidA, &Ia), EFI_ACCESS_DENIED);
-  D1.CloseOnStop = true;
-  int StoppedBefore = D1.Stopped;
-  EXPECT_EQ(Bs->UninstallProtocolInterface(Controller, &kGuidA, &Ia), EFI_SUCCESS);
-  EXPECT_GT(D1.Stopped, StoppedBefore);
-
-  Bs->UninstallProtocolInterface(Bare, &kGuidB, &Ia);
-  Bs->UninstallProtocolInterface(Driver1, &gEfiDriverBindingProtocolGuid, &D1.Binding);
-  Bs->UninstallProtocolInterface(Driver2, &gEfiDriverBindingProtocolGuid, &D2.Binding);
 }
 
 // ---------------------------------------------------------------------------
@@ -423,20 +277,6 @@ TEST_F(HostEnv, CollationMatchesCaseInsensitively) {
     EXPECT_EQ(Coll->MetaiMatch(Coll, &S[0], &P[0]) != 0, K.Match)
         << std::string(S.begin(), S.end()) << " ~ " << std::string(P.begin(), P.end());
   }
-
-  CHAR16 Mixed[] = u"MiXeD\u00e9";
-  Coll->StrUpr(Coll, Mixed);
-  EXPECT_EQ(std::u16string(Mixed), u"MIXED\u00c9");
-  Coll->StrLwr(Coll, Mixed);
-  EXPECT_EQ(std::u16string(Mixed), u"mixed\u00e9");
-
-  CHAR8 Fat[12] = {};
-  CHAR16 Name[] = u"a b.c*d";
-  EXPECT_TRUE(Coll->StrToFat(Coll, Name, 11, Fat));
-  EXPECT_STREQ(Fat, "ABC_D");
-  CHAR16 Back[12];
-  Coll->FatToStr(Coll, 3, Fat, Back);
-  EXPECT_EQ(std::u16string(Back), u"ABC");
 }
 
 } // namespace

@@ -122,15 +122,6 @@ TEST_F(MainTest, MountFailureIsRecordedAndTheUnmountDecidesTheExitValue) {
   EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
 }
 
-TEST_F(MainTest, ImageNameAloneOnlyRecordsTheOutcome) {
-  std::string Out;
-  EXPECT_EQ(RunImage({"CIFSDrv.efi"}, &Out), EFI_SUCCESS);
-  EXPECT_EQ(Out.find("Entering into IPMI Library"), std::string::npos);
-  EXPECT_EQ(Out.find("Mismatch"), std::string::npos);
-  EXPECT_EQ(VerifyStatus(), 0);
-  EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
-}
-
 TEST_F(MainTest, EntryRemovesItsRecordsFromTheImageHandle) {
   RunImage({"CIFSDrv.efi", "a", "b"});
   void *Interface = nullptr;

@@ -264,16 +264,4 @@ TEST_F(ShellCommandTest, LongOrCarelessLabelsAreReadWithinTheirBuffer) {
   EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
 }
 
-TEST_F(ShellCommandTest, RefreshNamesNewVolumesWithoutTouchingTheConsole) {
-  Bind();
-  FakeVolume *Fresh = AddVolume(u"FRESH", 0x03);
-  EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *ConOut = gST->ConOut;
-  std::string Out = Console([] { RefreshShellMappings(); });
-  EXPECT_EQ(Out, "");
-  EXPECT_EQ(gST->ConOut, ConOut);
-  EFI_DEVICE_PATH_PROTOCOL *Cursor = &Fresh->Path.Header;
-  EXPECT_NE(gShellEnv2->GetMapFromDevicePath(&Cursor), nullptr);
-  EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
-}
-
 } // namespace
