@@ -22,11 +22,6 @@
 # with the share, and the share is searched for the exported log.
 #
 # Settings (environment):
-#   FW_E2E_SHELL        builtin (default): the firmware's built-in shell runs
-#                       everything; nonest: the script runs in a second shell
-#                       instance started with -nonest (copied out of the OVMF
-#                       image), in which the shell's Execute runs commands in
-#                       that instance instead of a nested one
 #   FW_E2E_DEBUG_LEVEL  driver debug level stored before the runs (0 to 5)
 #   FW_E2E_LIMIT        time limit of the first boot in seconds (150)
 #   FW_CONSOLE_DIR      a directory the two boots' console logs are copied to
@@ -48,11 +43,6 @@ for tool in perl cmp gzip; do
   command -v "$tool" >/dev/null || fw_die "$tool not found (run scripts/install-deps.sh)"
 done
 
-SHELL_MODE=${FW_E2E_SHELL:-builtin}
-case "$SHELL_MODE" in
-builtin | nonest) ;;
-*) fw_die "FW_E2E_SHELL must be builtin or nonest, not $SHELL_MODE" ;;
-esac
 DEBUG_LEVEL=${FW_E2E_DEBUG_LEVEL:-}
 FIRST_LIMIT=${FW_E2E_LIMIT:-150}
 SECOND_LIMIT=60
@@ -219,42 +209,16 @@ second_boot_steps() {
   nsh_step not-listening "m $SMB_SHARE $SERVER Export VML $SMB_USER $SMB_PASS"
 }
 
-# write_scripts STEPS_FUNCTION: startup.nsh (and e2e.nsh for "nonest").
-# A second shell instance builds its own mappings, so everything after the
-# connect runs inside it.
+# write_scripts STEPS_FUNCTION: startup.nsh and the boot disk holding it.
 write_scripts() {
-  if [ "$SHELL_MODE" = builtin ]; then
-    {
-      echo "@echo -off"
-      nsh_connect
-      nsh_ramfs_and_network
-      "$1"
-      nsh_finish
-    } | fw_write_startup "$WORK/startup.nsh"
-  else
-    {
-      echo "@echo -off"
-      nsh_connect
-      printf '%s\n' '%bootfs%:\Shell.efi -nonest -nomap -noversion %bootfs%:\e2e.nsh'
-      nsh_finish
-    } | fw_write_startup "$WORK/startup.nsh"
-    {
-      echo "@echo -off"
-      echo 'echo "@@SHELL nonesting=%nonesting%"'
-      nsh_connect
-      nsh_ramfs_and_network
-      "$1"
-      nsh_finish
-    } | fw_write_startup "$WORK/e2e.nsh"
-  fi
-}
-
-make_boot_disk() {
+  {
+    echo "@echo -off"
+    nsh_connect
+    nsh_ramfs_and_network
+    "$1"
+    nsh_finish
+  } | fw_write_startup "$WORK/startup.nsh"
   fw_make_disk "$WORK/disk.img" "$EFI" "$WORK/startup.nsh"
-  if [ "$SHELL_MODE" = nonest ]; then
-    mcopy -i "$WORK/disk.img" "$WORK/e2e.nsh" ::/e2e.nsh || fw_die "mcopy of e2e.nsh failed"
-    mcopy -i "$WORK/disk.img" "$WORK/local/Shell.efi" ::/Shell.efi || fw_die "mcopy of the shell failed"
-  fi
 }
 
 # --- Running QEMU -----------------------------------------------------------------
@@ -318,19 +282,13 @@ run_first_boot() {
   done
 }
 
-if [ "$SHELL_MODE" = nonest ]; then
-  command -v python3 >/dev/null || fw_die "python3 not found"
-  python3 "$HERE/ovmf-shell.py" "$OVMF_CODE" "$WORK/local/Shell.efi"
-fi
 make_log
 write_scripts first_boot_steps
-make_boot_disk
 run_first_boot
 
 # Nothing listens: QEMU's restricted network resets every connection the
 # guest opens to the host, as a host with no server on port 445 does.
 write_scripts second_boot_steps
-make_boot_disk
 boot second "$SECOND_LIMIT" "user,id=n0,restrict=on"
 
 # --- Checks -------------------------------------------------------------------------
@@ -442,13 +400,9 @@ check_same() {
   fi
 }
 
-echo "e2e test: shell $SHELL_MODE"
 fw_check_contains "$FIRST" "@@DONE" "first boot: the startup script ran to its end"
 fw_check_contains "$FIRST" "@@RAMFS mapped" "first boot: the second disk was found by its marker and mapped as ramfs:"
 fw_check_contains "$FIRST" "@@NET up" "first boot: the network came up (DHCP)"
-if [ "$SHELL_MODE" = nonest ]; then
-  fw_check_contains "$FIRST" "@@SHELL nonesting=True" "first boot: the second shell runs without nesting"
-fi
 
 check_success mount
 
@@ -521,14 +475,6 @@ if [ -n "$import_time" ] && [ -n "$mount_time" ] && cmp -s "$(readback "$IMPORT_
     c = i - m
     printf "e2e test: 8 MiB import: %.1f s in all, about %.1f s of it the copy (less the %.1f s of a mount-only run), %.2f MiB/s\n", i, c, m, (c > 0 ? b / 1048576 / c : 0)
   }'
-fi
-
-if [ "$SHELL_MODE" = builtin ] && grep -q "GetFS:Drive name not found" "$FIRST"; then
-  echo "e2e test: note: the shell did not know the mounted share by any name. The built-in" \
-    "shell runs each command that the image hands to its Execute in a nested shell" \
-    "instance with mappings of its own, so the image's \"map\" commands and the" \
-    "names CIFS: and ramfs: do not reach the commands it runs (FW_E2E_SHELL=nonest" \
-    "runs the script in a shell without nesting)." >&2
 fi
 
 if [ "$FW_FAILURES" -ne 0 ]; then

@@ -1,7 +1,9 @@
 // The hosted UEFI environment seen through its tables, the way the image sees
-// it: the counted pool, events and timers under TPL rules, the handle
-// database, the variable store file and Unicode Collation.
+// it: the counted pool every leak check relies on, timers under TPL rules
+// (the keep-alive's), the variable store file and the RAM disk. (Its shell
+// is tested through the image's commands: ShellCommandTest, ShellBuiltinsTest.)
 #include "HostImageFixture.h"
+#include "HostInternal.h"
 
 #include <gtest/gtest.h>
 
@@ -78,29 +80,19 @@ void EFIAPI CountNotify(EFI_EVENT, void *Context) {
   Log->Bs->RestoreTPL(Log->TplSeen);
 }
 
-TEST_F(HostEnv, RelativeTimerNotifiesOnceInsideStallAtItsOwnLevel) {
+TEST_F(HostEnv, TimersNotifyInsideStallAtTheirLevelAndWaitForARaisedTpl) {
   NotifyLog Log;
   Log.Bs = Bs;
   EFI_EVENT Timer = nullptr;
   ASSERT_EQ(Bs->CreateEvent(EVT_TIMER | EVT_NOTIFY_SIGNAL, TPL_CALLBACK, CountNotify, &Log, &Timer),
             EFI_SUCCESS);
   ASSERT_EQ(Bs->SetTimer(Timer, TimerRelative, 100000), EFI_SUCCESS); // 10 ms
-  EXPECT_EQ(Log.Count, 0);
   Bs->Stall(40000);
   EXPECT_EQ(Log.Count, 1);
   EXPECT_EQ(Log.TplSeen, TPL_CALLBACK);
-  Bs->Stall(30000);
+  Bs->Stall(30000); // relative: once
   EXPECT_EQ(Log.Count, 1);
-  EXPECT_EQ(Bs->CloseEvent(Timer), EFI_SUCCESS);
-  EXPECT_EQ(Bs->CloseEvent(Timer), EFI_INVALID_PARAMETER);
-}
-
-TEST_F(HostEnv, RaisedTplHoldsNotificationsUntilRestore) {
-  NotifyLog Log;
-  Log.Bs = Bs;
-  EFI_EVENT Timer = nullptr;
-  ASSERT_EQ(Bs->CreateEvent(EVT_TIMER | EVT_NOTIFY_SIGNAL, TPL_CALLBACK, CountNotify, &Log, &Timer),
-            EFI_SUCCESS);
+  Log.Count = 0;
   EFI_TPL Old = Bs->RaiseTPL(TPL_CALLBACK); // equal level masks too
   EXPECT_EQ(Old, TPL_APPLICATION);
   Bs->SetTimer(Timer, TimerRelative, 0);
@@ -119,57 +111,9 @@ TEST_F(HostEnv, RaisedTplHoldsNotificationsUntilRestore) {
   EXPECT_EQ(Log.Count, 2);
   EXPECT_EQ(Log.TplSeen, TPL_NOTIFY);
   Bs->RestoreTPL(Old);
-  EXPECT_EQ(Bs->CheckEvent(Signal), EFI_INVALID_PARAMETER); // not for notify-signal events
-  Bs->CloseEvent(Timer);
+  EXPECT_EQ(Bs->CloseEvent(Timer), EFI_SUCCESS);
+  EXPECT_EQ(Bs->CloseEvent(Timer), EFI_INVALID_PARAMETER);
   Bs->CloseEvent(Signal);
-}
-
-// ---------------------------------------------------------------------------
-// Handle database
-// ---------------------------------------------------------------------------
-std::vector<EFI_HANDLE> HandlesWith(EFI_BOOT_SERVICES *Bs, const EFI_GUID &Guid) {
-  UINTN Count = 0;
-  EFI_HANDLE *Buffer = nullptr;
-  std::vector<EFI_HANDLE> Result;
-  if (Bs->LocateHandleBuffer(ByProtocol, &Guid, nullptr, &Count, &Buffer) == EFI_SUCCESS) {
-    Result.assign(Buffer, Buffer + Count);
-    Bs->FreePool(Buffer);
-  }
-  return Result;
-}
-
-TEST_F(HostEnv, HandlesAreListedInCreationOrderAndVanishWithTheirLastProtocol) {
-  int Ia = 1, Ib = 2, Ic = 3;
-  EFI_HANDLE H1 = nullptr, H2 = nullptr, H3 = nullptr;
-  ASSERT_EQ(Bs->InstallProtocolInterface(&H1, &kGuidA, EFI_NATIVE_INTERFACE, &Ia), EFI_SUCCESS);
-  ASSERT_EQ(Bs->InstallProtocolInterface(&H2, &kGuidB, EFI_NATIVE_INTERFACE, &Ib), EFI_SUCCESS);
-  ASSERT_EQ(Bs->InstallProtocolInterface(&H3, &kGuidA, EFI_NATIVE_INTERFACE, &Ic), EFI_SUCCESS);
-  EXPECT_EQ(HandlesWith(Bs, kGuidA), (std::vector<EFI_HANDLE>{H1, H3}));
-  EXPECT_EQ(Bs->InstallProtocolInterface(&H1, &kGuidA, EFI_NATIVE_INTERFACE, &Ic),
-            EFI_INVALID_PARAMETER);
-
-  void *Found = nullptr;
-  EXPECT_EQ(Bs->LocateProtocol(&kGuidA, nullptr, &Found), EFI_SUCCESS);
-  EXPECT_EQ(Found, &Ia);
-
-  // LocateHandle reports the size it needs.
-  UINTN Size = sizeof(EFI_HANDLE);
-  EFI_HANDLE Two[2] = {};
-  EXPECT_EQ(Bs->LocateHandle(ByProtocol, &kGuidA, nullptr, &Size, Two), EFI_BUFFER_TOO_SMALL);
-  EXPECT_EQ(Size, 2 * sizeof(EFI_HANDLE));
-  EXPECT_EQ(Bs->LocateHandle(ByProtocol, &kGuidA, nullptr, &Size, Two), EFI_SUCCESS);
-
-  EXPECT_EQ(Bs->UninstallProtocolInterface(H1, &kGuidA, &Ib), EFI_NOT_FOUND); // wrong interface
-  EXPECT_EQ(Bs->UninstallProtocolInterface(H1, &kGuidA, &Ia), EFI_SUCCESS);
-  EXPECT_EQ(Bs->HandleProtocol(H1, &kGuidA, &Found), EFI_INVALID_PARAMETER); // handle gone
-  EXPECT_EQ(HandlesWith(Bs, kGuidA), (std::vector<EFI_HANDLE>{H3}));
-  EXPECT_EQ(Bs->LocateProtocol(&kGuidA, nullptr, &Found), EFI_SUCCESS);
-  EXPECT_EQ(Found, &Ic);
-  EXPECT_EQ(Bs->HandleProtocol(H2, &kGuidA, &Found), EFI_UNSUPPORTED);
-
-  Bs->UninstallProtocolInterface(H2, &kGuidB, &Ib);
-  Bs->UninstallProtocolInterface(H3, &kGuidA, &Ic);
-  EXPECT_TRUE(HandlesWith(Bs, kGuidA).empty());
 }
 
 // ---------------------------------------------------------------------------
@@ -250,33 +194,46 @@ TEST_F(HostEnv, VariableServicesFollowFirmwareRules) {
   EXPECT_EQ(ReadStore().find(" W "), std::string::npos);
 }
 
-TEST_F(HostEnv, CollationMatchesCaseInsensitively) {
-  EFI_UNICODE_COLLATION_PROTOCOL *Coll = nullptr;
-  ASSERT_EQ(Bs->LocateProtocol(&gEfiUnicodeCollation2ProtocolGuid, nullptr,
-                               reinterpret_cast<void **>(&Coll)),
+// The RAM disk behind ramfs:, which every hosted run copies into: the file
+// semantics of a firmware FAT volume.
+TEST_F(HostEnv, RamfsFilesFollowFirmwareSemantics) {
+  void *Fs = nullptr;
+  ASSERT_EQ(Bs->HandleProtocol(HostRamfsHandle(), &gEfiSimpleFileSystemProtocolGuid, &Fs),
             EFI_SUCCESS);
-  EXPECT_EQ(strncmp(Coll->SupportedLanguages, "eng", 3), 0);
-
-  CHAR16 A[] = u"Catalog.XML", B[] = u"catalog.xml", C[] = u"catalog.xmm";
-  EXPECT_EQ(Coll->StriColl(Coll, A, B), 0);
-  EXPECT_LT(Coll->StriColl(Coll, B, C), 0);
-
-  struct Case {
-    const char16_t *String, *Pattern;
-    bool Match;
-  } Cases[] = {{u"catalog.xml.gz", u"*.XML.GZ", true},
-               {u"catalog.xml", u"*.xml.gz", false},
-               {u"ac", u"a?c", false},
-               {u"file7", u"file[0-9]", true},
-               {u"Bx", u"[abc]x", true},
-               {u"a", u"[a", false},
-               {u"", u"*", true},
-               {u"mississippi", u"m*iss*ppi", true}};
-  for (const Case &K : Cases) {
-    std::u16string S = K.String, P = K.Pattern;
-    EXPECT_EQ(Coll->MetaiMatch(Coll, &S[0], &P[0]) != 0, K.Match)
-        << std::string(S.begin(), S.end()) << " ~ " << std::string(P.begin(), P.end());
-  }
+  auto *Sfs = static_cast<EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *>(Fs);
+  EFI_FILE_PROTOCOL *Root = nullptr, *Dir = nullptr, *File = nullptr, *Again = nullptr;
+  const UINT64 Create = EFI_FILE_MODE_CREATE | EFI_FILE_MODE_READ | EFI_FILE_MODE_WRITE;
+  ASSERT_EQ(Sfs->OpenVolume(Sfs, &Root), EFI_SUCCESS);
+  ASSERT_EQ(Root->Open(Root, &Dir, u"\\Logs", Create, EFI_FILE_DIRECTORY), EFI_SUCCESS);
+  ASSERT_EQ(Dir->Open(Dir, &File, u"Report.TXT", Create, 0), EFI_SUCCESS);
+  std::string Data = "hello world";
+  UINTN Size = Data.size();
+  EXPECT_EQ(File->Write(File, &Size, Data.data()), EFI_SUCCESS);
+  EXPECT_EQ(File->SetPosition(File, 6), EFI_SUCCESS);
+  char Buffer[32] = {};
+  Size = sizeof Buffer;
+  EXPECT_EQ(File->Read(File, &Size, Buffer), EFI_SUCCESS);
+  EXPECT_EQ(std::string(Buffer, Size), "world");
+  Size = sizeof Buffer; // at the end: success with nothing; past it: an error
+  EXPECT_EQ(File->Read(File, &Size, Buffer), EFI_SUCCESS);
+  EXPECT_EQ(Size, 0u);
+  EXPECT_EQ(File->SetPosition(File, 20), EFI_SUCCESS);
+  EXPECT_EQ(File->Read(File, &Size, Buffer), EFI_DEVICE_ERROR);
+  EXPECT_EQ(File->SetPosition(File, 0xFFFFFFFFFFFFFFFFULL), EFI_SUCCESS); // the end
+  Size = 1;
+  EXPECT_EQ(File->Write(File, &Size, const_cast<char *>("!")), EFI_SUCCESS);
+  EXPECT_EQ(ReadFile(RamfsDir + "/Logs/Report.TXT"), "hello world!");
+  // Names match whatever their case; "." and ".." walk as in a path.
+  ASSERT_EQ(Root->Open(Root, &Again, u"\\LOGS\\.\\..\\logs\\report.txt", EFI_FILE_MODE_READ, 0),
+            EFI_SUCCESS);
+  EXPECT_EQ(Again->Write(Again, &Size, Buffer), EFI_ACCESS_DENIED);
+  EXPECT_EQ(Again->Close(Again), EFI_SUCCESS);
+  EXPECT_EQ(Root->Open(Root, &Again, u"\\none\\x.txt", Create, 0), EFI_NOT_FOUND);
+  EXPECT_EQ(Root->Open(Root, &Again, u"\\Logs", EFI_FILE_MODE_WRITE, 0), EFI_INVALID_PARAMETER);
+  EXPECT_EQ(File->Delete(File), EFI_SUCCESS);
+  EXPECT_EQ(Dir->Delete(Dir), EFI_SUCCESS); // empty again
+  EXPECT_FALSE(std::filesystem::exists(RamfsDir + "/Logs"));
+  EXPECT_EQ(Root->Delete(Root), EFI_WARN_DELETE_FAILURE); // the root stays, its handle goes
 }
 
 } // namespace
