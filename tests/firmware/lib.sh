@@ -175,15 +175,6 @@ fw_check_absent_text() {
   if grep -qF -- "$2" <<<"$1"; then fw_fail "$3 (found \"$2\")"; else fw_pass "$3"; fi
 }
 
-# fw_check_count TEXT LINE COUNT DESCRIPTION [nocase]: LINE occurs as a
-# whole line exactly COUNT times (ignoring case with "nocase").
-fw_check_count() {
-  local n flags=-cxF
-  [ "${5:-}" = nocase ] && flags=-cixF
-  n=$(grep "$flags" -- "$2" <<<"$1" || true)
-  if [ "$n" -eq "$3" ]; then fw_pass "$4"; else fw_fail "$4 (\"$2\" seen $n times, want $3)"; fi
-}
-
 # fw_check_nonzero_lasterror TEXT DESCRIPTION
 fw_check_nonzero_lasterror() {
   local value

@@ -190,25 +190,4 @@ TEST_F(DiagLogTest, StandardLines) {
                            " - x, Status = 21 (0x15)\n");
 }
 
-TEST_F(DiagLogTest, EachChannelHasItsOwnLevel) {
-  gDriverDebugLevel = 1;
-  gSMB2DebugLevel = 5;
-  gTcpDebugLevel = 0;
-  DiagLog(DIAG_ALWAYS, "a");
-  DiagLog(DIAG_MISMATCH, "b");
-  DiagLog(DIAG_TRACE, "X");
-  DiagLogW(DIAG_TRACE, u"X");
-  DiagEntry(DiagChannel::Driver, "X", 1);
-  DiagShortExit(EFI_SUCCESS);
-  DiagGuid(DIAG_VERBOSE, nullptr, LevelGuid);
-  Smb2Log(DIAG_VERBOSE, "c");
-  Smb2Log(DIAG_DUMP, "X");
-  DiagErrorAt(DiagChannel::Smb2, DIAG_DUMP, "X", EFI_ABORTED, "f", 1);
-  TcpLog(DIAG_ALWAYS, "d");
-  TcpLog(DIAG_TRACE, "X");
-  gDriverDebugLevel = 0;
-  DiagError("e", EFI_ABORTED, "g", 2); // error lines print whatever the level
-  EXPECT_EQ(Console(), "abcdFunction: g, Line no.: = 2 - e, Status = 21 (0x15)\n");
-}
-
 } // namespace

@@ -146,14 +146,6 @@ TEST_F(MountTest, MountInstallsTheVolumeAndUnmountTakesItAllDown) {
   EXPECT_EQ(gMountShareType, 0u);
 }
 
-TEST_F(MountTest, UnmountWithoutVolumeSucceedsAndDeInitialises) {
-  gNwLibInitialized = TRUE;
-  gMountShareType = NWFS_SHARE_TYPE_CIFS;
-  EXPECT_EQ(Unmount(), EFI_SUCCESS);
-  EXPECT_EQ(gMountShareType, 0u);
-  ExpectNothingLeft();
-}
-
 TEST_F(MountTest, FailedConnectLeavesNothingBehindAndAllowsAnotherMount) {
   HostSetConnectPortOverride(ClosedPort());
   std::string Out;
@@ -216,22 +208,6 @@ TEST_F(MountTest, FailedMountIsRetriedWithTheOtherSlashes) {
   }
   Unmount();
   ExpectNothingLeft();
-}
-
-TEST_F(MountTest, DriverNameIsGivenInEnglishOnly) {
-  CHAR16 *Name = nullptr;
-  EXPECT_EQ(gSimpleFileSystemComponentName.GetDriverName(&gSimpleFileSystemComponentName,
-                                                         const_cast<CHAR8 *>("eng"), &Name),
-            EFI_SUCCESS);
-  EXPECT_EQ(HostUcs2ToUtf8(Name), "PIOMISKU File System Driver");
-  EXPECT_EQ(gSimpleFileSystemComponentName.GetDriverName(&gSimpleFileSystemComponentName,
-                                                         const_cast<CHAR8 *>("fra"), &Name),
-            EFI_UNSUPPORTED);
-  // No volume of this image on the ramfs: handle.
-  EXPECT_EQ(gSimpleFileSystemComponentName.GetControllerName(&gSimpleFileSystemComponentName,
-                                                             HostRamfsHandle(), nullptr,
-                                                             const_cast<CHAR8 *>("eng"), &Name),
-            EFI_UNSUPPORTED);
 }
 
 } // namespace

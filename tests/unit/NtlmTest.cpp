@@ -191,14 +191,8 @@ TEST_F(NtlmTest, DomainChoice) {
   EXPECT_STREQ(TransactDetails.ShareDetails.DomainName, "WORKGROUP");
   EXPECT_TRUE(Contains(Out, "Using default domain = WORKGROUP\n"));
 
-  // Characters beyond Latin-1 narrow to '?'.
-  Shape.TargetName = Utf16("S");
-  Bytes Wide = {'A', 0, 0x3A, 0x04, 0xE9, 0};
-  Shape.TargetInfo = Concat({AvPair(2, Wide), AvEol()});
-  ASSERT_EQ(Receive(MockSmb::Challenge(Shape), "u", "p", ""), EFI_SUCCESS);
-  EXPECT_STREQ(TransactDetails.ShareDetails.DomainName, "A?\xE9");
-
   // Target info ahead of the name: the walk stays on the target info.
+  Shape.TargetName = Utf16("S");
   Shape.InfoBeforeName = true;
   Shape.TargetInfo = MockSmb::DefaultTargetInfo("FIRST");
   ASSERT_EQ(Receive(MockSmb::Challenge(Shape), "u", "p", ""), EFI_SUCCESS);
@@ -223,9 +217,6 @@ TEST_F(NtlmTest, MalformedTargetInfoIsRefusedCleanly) {
   // Fields pointing outside what was received.
   Shape = MockSmb::ChallengeShape();
   Shape.InfoOffset = 4000;
-  EXPECT_EQ(Receive(MockSmb::Challenge(Shape), "u", "p", "D"), EFI_PROTOCOL_ERROR);
-  Shape = MockSmb::ChallengeShape();
-  Shape.InfoLength = 0xFFFF;
   EXPECT_EQ(Receive(MockSmb::Challenge(Shape), "u", "p", "D"), EFI_PROTOCOL_ERROR);
   Shape = MockSmb::ChallengeShape();
   Shape.NameOffset = 0xFFFFFFF0;

@@ -194,19 +194,6 @@ TEST_F(NwVolumeTest, LabelFromAListingEntryCountsCharactersNotBytes) {
   EXPECT_EQ(Size, 7u);
 }
 
-TEST_F(NwVolumeTest, LabelWithoutIdentifierOrEntryIsEmpty) {
-  Volume->Valid = 0;
-  Seed(RootRecord, {{u"plain", 0x20, 0}});
-  CHAR16 Label[4] = {u'x', u'x', u'x', 0};
-  UINTN Size = sizeof(Label);
-  EXPECT_EQ(GetVolumeLabel(Volume, &Size, Label), EFI_SUCCESS);
-  EXPECT_EQ(Size, 2u);
-  EXPECT_EQ(Label[0], 0);
-  Size = 1;
-  EXPECT_EQ(GetVolumeLabel(Volume, &Size, Label), EFI_BUFFER_TOO_SMALL);
-  EXPECT_EQ(Size, 2u);
-}
-
 TEST_F(NwVolumeTest, SetInfoGuardsTheRootAndTheBufferSizes) {
   EFI_FILE_PROTOCOL *H = Root;
   std::vector<UINT8> Buffer(120);

@@ -140,16 +140,6 @@ TEST_F(ProvisioningVarsTest, NvramStringCheckRefusesControlCharactersWithinTheFi
   EXPECT_TRUE(IsNvramStringValid(Full, 129));
 }
 
-TEST_F(ProvisioningVarsTest, TextFieldRecordIsReturnedAsStoredWhenEveryFieldIsText) {
-  PU_PROVISIONING_RECORD Stored = ValidRecord();
-  memset(Stored.Text2, 'z', sizeof(Stored.Text2)); // 128 bytes, no NUL
-  WriteVar(PU_PROVISIONING_VAR_NAME, gPUProvisioningEnvGuid, 3, Bytes(Stored));
-  PU_PROVISIONING_RECORD Read;
-  std::string Out = Console([&] { ASSERT_EQ(GetPUProvisioningEnvVar(&Read), &Read); });
-  EXPECT_EQ(Bytes(Read), Bytes(Stored));
-  EXPECT_EQ(Out.find("Corruption"), std::string::npos);
-}
-
 TEST_F(ProvisioningVarsTest, CorruptedTextFieldRecordIsRewrittenWithDefaults) {
   UseIpmi({0x00, 0x00, 0x11, 0x00, 0x00, 0x00, 0x00, 0x00});
   PU_PROVISIONING_RECORD Stored = ValidRecord();
@@ -196,21 +186,6 @@ TEST_F(ProvisioningVarsTest, TextFieldRecordSetRefusesCorruptedFields) {
   Console([&] { EXPECT_EQ(SetPUProvisioningEnvVar(&Record), EFI_SUCCESS); });
   Variable Stored = ReadVar(PU_PROVISIONING_VAR_NAME, gPUProvisioningEnvGuid);
   EXPECT_EQ(Stored.Data, Bytes(Record));
-  EXPECT_EQ(Stored.Attributes, 3u);
-}
-
-TEST_F(ProvisioningVarsTest, CatalogFlagRoundTripAndReset) {
-  UINT32 Value = 7;
-  Console([&] { EXPECT_EQ(GetCatalogEnvVar(&Value), nullptr); });
-  Value = 2;
-  EXPECT_EQ(SetCatalogEnvVar(&Value), EFI_SUCCESS);
-  UINT32 Read = 0;
-  ASSERT_EQ(GetCatalogEnvVar(&Read), &Read);
-  EXPECT_EQ(Read, 2u);
-  Console([&] { EXPECT_EQ(ResetCatalogEnvVar(&Value), EFI_SUCCESS); });
-  EXPECT_EQ(Value, 0u);
-  Variable Stored = ReadVar(CATALOG_FILE_VAR_NAME, gCatalogFileEnvGuid);
-  EXPECT_EQ(Stored.Data, std::vector<UINT8>(4, 0));
   EXPECT_EQ(Stored.Attributes, 3u);
 }
 

@@ -205,13 +205,6 @@ TEST_F(TasksTest, SignatureMissingOnTheShareIsReported) {
   ExpectNoPoolLeak();
 }
 
-TEST_F(TasksTest, SignatureWithoutTextFieldRecordDoesNothing) {
-  WriteFile(ShareDir + "/catalog.xml.gz.sign", "signature");
-  EXPECT_EQ(Quiet([&] { return CopyCatalogSignatureToRamfs(); }), EFI_SUCCESS);
-  EXPECT_FALSE(fs::exists(RamfsDir + "/catalog.xml.gz.sign"));
-  ExpectNoPoolLeak();
-}
-
 TEST_F(TasksTest, AllocationFailuresAreReportedWithoutLeaks) {
   WriteFile(ShareDir + "/catalog/catalog.xml.gz", "gz");
   WriteFile(ShareDir + "/dir/image.bin", "payload");
