@@ -8,7 +8,6 @@
 set -u
 E2E_HERE=$(cd "$(dirname "${BASH_SOURCE[0]}")" && pwd)
 source "$E2E_HERE/lib.sh"
-source "$E2E_HERE/../support/e2e-share.sh"
 e2e_init "${1:?usage: run-catalog.sh PATH_TO_CIFSDRV}"
 e2e_share_start
 

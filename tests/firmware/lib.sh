@@ -229,37 +229,3 @@ fw_hex_text() {
   done
   printf '%s' "$out"
 }
-
-# fw_stamp_markers LOG OUT: in the background, follows the serial log LOG
-# (which must not exist yet: fw_boot creates it) and writes each "@@" line it
-# sees to OUT, prefixed with this machine's time in seconds. Its process id
-# is left in FW_STAMPER_PID and added to FW_CLEANUP_PIDS.
-fw_stamp_markers() {
-  perl -MTime::HiRes=time,sleep -e '
-    my ($log, $out) = @ARGV;
-    open(my $o, ">", $out) or die "$out: $!";
-    $o->autoflush(1);
-    my $in;
-    sleep 0.05 until open($in, "<", $log);
-    my $pending = "";
-    while (1) {
-      my $n = sysread($in, my $chunk, 65536);
-      if (!$n) { sleep 0.05; next; }
-      $pending .= $chunk;
-      while ($pending =~ s/^([^\n]*)\n//) {
-        my $line = $1;
-        $line =~ s/\e\[[0-9;?=]*[A-Za-z]//g;
-        $line =~ s/[\r\s]+$//;
-        printf $o "%.2f %s\n", time, $line if $line =~ /^@@/;
-      }
-    }
-  ' "$1" "$2" &
-  FW_STAMPER_PID=$!
-  FW_CLEANUP_PIDS+=("$FW_STAMPER_PID")
-}
-
-# fw_marker_time STAMPS LINE: the time at which LINE was first seen.
-fw_marker_time() {
-  [ -f "$1" ] || return 0
-  awk -v want="$2" '{ t = $1; $1 = ""; sub(/^ /, "") } $0 == want { print t; exit }' "$1"
-}
