@@ -261,53 +261,6 @@ TEST_F(ExportTest, MalformedSmbiosTablesAreRejectedWithinTheirBounds) {
   }
 }
 
-TEST_F(ExportTest, EntryPointsAreCheckedBeforeTheirTableIsUsed) {
-  // The hosted platform serves valid 2.x and 3.x entry points: both lead to
-  // the tag set for the machine.
-  HostSetSmbiosAssetTag("HOST-TAG");
-  const void *Entry2 = nullptr;
-  const void *Entry3 = nullptr;
-  for (UINTN I = 0; I < gST->NumberOfTableEntries; I++) {
-    if (EfiGuidEqual(gST->ConfigurationTable[I].VendorGuid, gEfiSmbiosTableGuid)) {
-      Entry2 = gST->ConfigurationTable[I].VendorTable;
-    }
-    if (EfiGuidEqual(gST->ConfigurationTable[I].VendorGuid, gEfiSmbios3TableGuid)) {
-      Entry3 = gST->ConfigurationTable[I].VendorTable;
-    }
-  }
-  ASSERT_NE(Entry2, nullptr);
-  ASSERT_NE(Entry3, nullptr);
-  CHAR8 Tag[EXPORT_TAG_CHARS];
-  EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Entry2, false, Tag, sizeof(Tag)), EFI_SUCCESS);
-  EXPECT_STREQ(Tag, "HOST-TAG");
-  EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Entry3, true, Tag, sizeof(Tag)), EFI_SUCCESS);
-  EXPECT_STREQ(Tag, "HOST-TAG");
-  EXPECT_EQ(GetSmbiosAssetTag(Tag, sizeof(Tag)), EFI_SUCCESS);
-  EXPECT_STREQ(Tag, "HOST-TAG");
-
-  // Copies bent one way at a time: wrong anchor, wrong length, checksum.
-  std::vector<UINT8> Copy3(static_cast<const UINT8 *>(Entry3),
-                           static_cast<const UINT8 *>(Entry3) + 0x18);
-  std::vector<UINT8> Copy2(static_cast<const UINT8 *>(Entry2),
-                           static_cast<const UINT8 *>(Entry2) + 0x1F);
-  auto Bent = [](std::vector<UINT8> Bytes, size_t At, UINT8 Value) {
-    Bytes[At] = Value;
-    return Bytes;
-  };
-  std::string Ignored = Console([&] {
-    EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Copy3.data(), true, Tag, sizeof(Tag)), EFI_SUCCESS);
-    EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Bent(Copy3, 3, 'X').data(), true, Tag, sizeof(Tag)),
-              EFI_COMPROMISED_DATA);
-    EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Bent(Copy3, 6, 0x20).data(), true, Tag, sizeof(Tag)),
-              EFI_COMPROMISED_DATA);
-    EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Copy2.data(), false, Tag, sizeof(Tag)), EFI_SUCCESS);
-    EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Bent(Copy2, 0x12, 'X').data(), false, Tag, sizeof(Tag)),
-              EFI_COMPROMISED_DATA);
-    EXPECT_EQ(SmbiosAssetTagFromEntryPoint(Bent(Copy2, 0x16, 0x00).data(), false, Tag, sizeof(Tag)),
-              EFI_COMPROMISED_DATA);
-  });
-}
-
 // ---------------------------------------------------------------------------
 // sysInfo.xml
 // ---------------------------------------------------------------------------

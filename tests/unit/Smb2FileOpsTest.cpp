@@ -254,47 +254,6 @@ TEST_F(Smb2FileRequestTest, CreateNamesArePaddedAndBounded) {
   }
 }
 
-TEST_F(Smb2FileRequestTest, CreateContextsFollowTheOplockLevelAndTheServersLeasing) {
-  struct Case {
-    UINT8 Oplock;
-    UINT32 Capabilities;
-    UINT32 ContextsLength;
-    bool Offset;
-    UINT32 LeaseState;
-  } Cases[] = {
-      {0, SMB2_GLOBAL_CAP_LEASING, 0, false, 0},
-      {1, SMB2_GLOBAL_CAP_LEASING, 56, true, 1},
-      {8, SMB2_GLOBAL_CAP_LEASING, 56, true, 5},
-      {9, SMB2_GLOBAL_CAP_LEASING, 96, true, 7},
-      {8, 0, 0, false, 0},
-      {9, 0, 40, false, 0}, // batch without leasing: 40 bytes counted, offset left 0
-  };
-  for (const Case &C : Cases) {
-    SMB2FreeCreateContexts(&Access);
-    TransactDetails.ServerCapabilities = C.Capabilities;
-    Built B = BuildCreate("f.txt", C.Oplock);
-    ASSERT_EQ(B.Status, EFI_SUCCESS);
-    SCOPED_TRACE(testing::Message() << "oplock " << +C.Oplock << " caps " << C.Capabilities);
-    EXPECT_EQ(+B.Packet.CreateContextsLength, C.ContextsLength);
-    EXPECT_EQ(+B.Packet.CreateContextsOffset, C.Offset ? 120u + 16 : 0u);
-    EXPECT_EQ(B.Total, 124u + 16 + C.ContextsLength + 2);
-    if (C.LeaseState != 0) {
-      const auto *Lease = reinterpret_cast<const SMB2_CREATE_LEASE_CONTEXT *>(Access.LeaseContext);
-      ASSERT_NE(Lease, nullptr);
-      EXPECT_EQ(std::string(Lease->Header.Name, 4), "RqLs");
-      EXPECT_EQ(+Lease->LeaseState, C.LeaseState);
-      EXPECT_EQ(+Lease->Header.Next, C.Oplock == 9 ? 56u : 0u);
-    }
-    if (C.Oplock == 9) {
-      const auto *Durable =
-          reinterpret_cast<const SMB2_CREATE_DURABLE_CONTEXT *>(Access.DurableContext);
-      ASSERT_NE(Durable, nullptr);
-      EXPECT_EQ(std::string(Durable->Header.Name, 4), "DHnQ");
-      EXPECT_EQ(+Access.DurableContextLength, 40u);
-    }
-  }
-}
-
 TEST_F(Smb2FileRequestTest, InformationAnswersLandInTheirOwnFields) {
   SMB2_QUERY_RESPONSE Packet = {};
   QUERY_DETAILS Query = {};
@@ -588,24 +547,6 @@ TEST_F(Smb2FileOpsHostileTest, ResetOrCloseInTheMiddleOfAReadEndsIt) {
   EXPECT_EQ(+gFileAccessDetails.TransportStatus, 54u);
   EXPECT_TRUE(Contains(Out, "Server has reset, so exiting!\n")) << Out;
   EXPECT_EQ(Buffer[64511], 1);
-}
-
-TEST_F(Smb2FileOpsHostileTest, PeerThatClosesInTheMiddleOfDataDoesNotHang) {
-  ScriptConnect();
-  Expect([](uint64_t Id) { return CreateAnswer(Id); });
-  Server.Respond([](const Bytes &Request) {
-    Bytes Whole = ReadAnswer(MessageIdOf(Request), Bytes(5000, 3));
-    return Bytes(Whole.begin(), Whole.begin() + 84 + 100);
-  });
-  Server.Close();
-  Connect();
-  NW_REMOTE_FILE File;
-  ASSERT_EQ(Open(u"f", &File), EFI_SUCCESS);
-  std::vector<UINT8> Buffer(5000);
-  UINTN Count = 0;
-  std::string Out;
-  EXPECT_EQ(ReadFile(&File, Buffer.data(), Buffer.size(), &Count, &Out), EFI_DEVICE_ERROR);
-  EXPECT_EQ(Count, 0u);
 }
 
 TEST_F(Smb2FileOpsHostileTest, CreateWithZeroFileIdOrContextsBeyondTheAnswer) {
