@@ -1,14 +1,13 @@
 // The pure pieces of the firmware image's platform layer, run on the host:
-// address text parsing and calendar conversion (each cross-checked against
-// the C library, which implements the same rules), and the block-memory
-// primitives behind the image's memcpy/memmove/memset/memcmp.
+// address text parsing and calendar conversion, each cross-checked against
+// the C library, which implements the same rules. (The block-memory
+// primitives are in every firmware test's path.)
 //
 // The firmware platform's translation units are compiled into this test
 // directly; the image's socket and runtime files themselves would clash with
 // the host's.
 #include "../../Platform/Uefi/EfiTime.cpp"
 #include "../../Platform/Uefi/InetText.cpp"
-#include "../../Platform/Uefi/MemOps.h"
 
 #include <gtest/gtest.h>
 
@@ -124,43 +123,6 @@ TEST(EfiTime, ZoneAndDaylightShiftToUtc) {
   Summer.TimeZone = kEfiUnspecifiedTimeZone;
   ASSERT_TRUE(EfiTimeToUnixSeconds(Summer, &Seconds));
   EXPECT_EQ(1782914400, Seconds); // 14:00 UTC
-}
-
-// --- Block memory ---------------------------------------------------------------
-
-// Lengths around the word size at overlaps in both directions, against
-// a byte-at-a-time copy through a temporary.
-TEST(MemOps, MoveHandlesEveryOverlap) {
-  constexpr size_t kArena = 96;
-  constexpr size_t kBase = 24;
-  for (size_t Length : {0, 1, 7, 8, 9, 16, 17, 33}) {
-    for (int Shift : {-17, -9, -8, -1, 1, 7, 8, 17}) {
-      uint8_t Arena[kArena];
-      uint8_t Expected[kArena];
-      for (size_t I = 0; I < kArena; I++) {
-        Arena[I] = Expected[I] = static_cast<uint8_t>(I * 7 + 1);
-      }
-      const size_t From = kBase;
-      const size_t To = static_cast<size_t>(static_cast<int>(kBase) + Shift);
-      uint8_t Temporary[kArena];
-      for (size_t I = 0; I < Length; I++) {
-        Temporary[I] = Expected[From + I];
-      }
-      for (size_t I = 0; I < Length; I++) {
-        Expected[To + I] = Temporary[I];
-      }
-      UefiMem::Move(Arena + To, Arena + From, Length);
-      ASSERT_EQ(0, std::memcmp(Arena, Expected, kArena))
-          << "length " << Length << " shift " << Shift;
-    }
-  }
-}
-
-TEST(MemOps, CompareOrdersBytesAsUnsigned) {
-  const uint8_t A[] = {1, 2, 0x80, 4}, B[] = {1, 2, 0x7F, 9};
-  EXPECT_GT(UefiMem::Compare(A, B, 4), 0);
-  EXPECT_LT(UefiMem::Compare(B, A, 4), 0);
-  EXPECT_EQ(0, UefiMem::Compare(A, B, 2));
 }
 
 } // namespace
