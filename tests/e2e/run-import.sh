@@ -23,12 +23,6 @@ e2e_check "I: landed in the root" e2e_same_file "$CIFSDRV_RAMFS/f.img" "$SMB_DIR
 e2e_check "I: exit value 0" test "$E2E_RC" -eq 0
 e2e_verify_status "I" 00
 
-e2e_fresh
-e2e_cifsdrv I 'absent.img'
-e2e_check_run "absent file"
-e2e_check "absent file: exit value 0" test "$E2E_RC" -eq 0
-e2e_verify_status "absent file" 0e
-
 # "e ... Import" with BKP and UnattendOsd, with and without a path.
 e2e_fresh
 e2e_share_put backups/node7.img "backup image"

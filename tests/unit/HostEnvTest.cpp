@@ -150,18 +150,6 @@ TEST_F(HostEnv, VariablesRoundTripThroughTheStoreFile) {
   Size = sizeof Buffer;
   ASSERT_EQ(Rt->GetVariable(u"odd name%é", &kGuidA, nullptr, &Size, Buffer), EFI_SUCCESS);
   EXPECT_EQ(Buffer[0], 0x5A);
-
-  // A fresh environment on the same file sees the same store.
-  HostShutdown();
-  HostConfig Config;
-  Config.RamfsDir = RamfsDir.c_str();
-  Config.VarStore = VarStore.c_str();
-  St = HostInitialize(Config);
-  Rt = St->RuntimeServices;
-  Size = sizeof Buffer;
-  ASSERT_EQ(Rt->GetVariable(u"PROVISIONING_ENV_VAR", &kProvisioningGuid, nullptr, &Size, Buffer),
-            EFI_SUCCESS);
-  EXPECT_EQ(0, memcmp(Buffer, Record, sizeof Record));
 }
 
 TEST_F(HostEnv, VariableServicesFollowFirmwareRules) {

@@ -111,14 +111,6 @@ TEST_F(MainTest, MountFailureIsRecordedAndTheUnmountDecidesTheExitValue) {
   EXPECT_EQ(Outcome.Data[0], MountError);
   EXPECT_TRUE(std::equal(Preset.begin() + 1, Preset.end(), Outcome.Data.begin() + 1));
 
-  Variable Created = ReadVar(PROVISIONING_VOLATILE_VAR_NAME, gProvisioningVolatileInitGuid);
-  EXPECT_EQ(Created.Data, std::vector<UINT8>(40, 0));
-  EXPECT_EQ(Created.Attributes, PROVISIONING_VOLATILE_ATTRIBUTES);
-  Variable Settings = ReadVar(PROVISIONING_ENV_VAR_NAME, gProvisioningEnvGuid);
-  ASSERT_EQ(Settings.Data.size(), 396u);
-  EXPECT_EQ(Settings.Attributes, PROVISIONING_NV_ATTRIBUTES);
-  EXPECT_STREQ(reinterpret_cast<const char *>(Settings.Data.data() + 140),
-               PROVISIONING_DOWNLOAD_HOST);
   EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
 }
 

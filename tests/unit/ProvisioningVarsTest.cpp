@@ -105,17 +105,6 @@ TEST_F(ProvisioningVarsTest, EnvironmentCopyTakesTextVariablesAndMappings) {
   ASSERT_EQ(gMapDeviceList->DevicePathSize, Path.size());
   EXPECT_EQ(memcmp(gMapDeviceList->DevicePath, Path.data(), Path.size()), 0);
 
-  // A second copy overwrites instead of adding.
-  UINTN Entries = NwEnvCount();
-  WriteVar(u"NarrowVar", Other, 3, {'n', 'e', 'w'});
-  ReleaseProvisioningEnv();
-  Console([] { _InitializeEnv(); });
-  EXPECT_EQ(NwEnvCount(), Entries);
-  EXPECT_STREQ(NwGetEnv("NarrowVar"), "new");
-  NwSetEnv("NarrowVar", "again");
-  EXPECT_EQ(NwEnvCount(), Entries);
-  EXPECT_STREQ(NwGetEnv("NarrowVar"), "again");
-
   ReleaseProvisioningEnv();
   EXPECT_EQ(gMapDeviceList, nullptr);
   EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
