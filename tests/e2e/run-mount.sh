@@ -1,7 +1,6 @@
 #!/usr/bin/env bash
-# Mount and unmount of a Samba share on loopback: action "m" alone, "M" in
-# the standard layout, the exit value and VerifyStatus, and a server that is
-# not there.
+# Mount and unmount of a Samba share on loopback: action "m" alone, the exit
+# value and VerifyStatus, and a server that is not there.
 #
 # Usage: run-mount.sh PATH_TO_CIFSDRV
 set -u
@@ -23,14 +22,6 @@ e2e_check "m: unmounted" e2e_out_has "Exiting UnmountStaticFileSystem. Status = 
 e2e_check "m: nothing copied" test -z "$(ls -A "$CIFSDRV_RAMFS")"
 e2e_check "m: share untouched" test "$(ls -A "$SMB_DIR")" = keep.txt
 e2e_verify_status "m" 00
-
-# "M" uses the standard layout and does nothing either.
-e2e_fresh
-e2e_cifsdrv M
-e2e_check_run "M"
-e2e_check "M: exit value 0" test "$E2E_RC" -eq 0
-e2e_check "M: no mount failure" e2e_out_lacks "Mount partition failed!"
-e2e_verify_status "M" 00
 
 # A server that is not there (nothing listens on 127.0.0.2): the outcome
 # says so, the exit value is the unmount's.

@@ -1,7 +1,7 @@
 // The hosted UEFI environment seen through its tables, the way the image sees
 // it: the counted pool every leak check relies on, timers under TPL rules
-// (the keep-alive's), the variable store file and the RAM disk. (Its shell
-// is tested through the image's commands: ShellCommandTest, ShellBuiltinsTest.)
+// (the keep-alive's) and the variable store file. (Its shell and RAM disk are
+// tested through the image's commands and tasks.)
 #include "HostImageFixture.h"
 #include "HostInternal.h"
 
@@ -180,48 +180,6 @@ TEST_F(HostEnv, VariableServicesFollowFirmwareRules) {
   ASSERT_EQ(Rt->SetVariable(u"W", &kGuidA, 2, 1, Data), EFI_SUCCESS);
   EXPECT_EQ(Rt->SetVariable(u"W", &kGuidA, 0, 1, Data), EFI_SUCCESS); // delete by attributes 0
   EXPECT_EQ(ReadStore().find(" W "), std::string::npos);
-}
-
-// The RAM disk behind ramfs:, which every hosted run copies into: the file
-// semantics of a firmware FAT volume.
-TEST_F(HostEnv, RamfsFilesFollowFirmwareSemantics) {
-  void *Fs = nullptr;
-  ASSERT_EQ(Bs->HandleProtocol(HostRamfsHandle(), &gEfiSimpleFileSystemProtocolGuid, &Fs),
-            EFI_SUCCESS);
-  auto *Sfs = static_cast<EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *>(Fs);
-  EFI_FILE_PROTOCOL *Root = nullptr, *Dir = nullptr, *File = nullptr, *Again = nullptr;
-  const UINT64 Create = EFI_FILE_MODE_CREATE | EFI_FILE_MODE_READ | EFI_FILE_MODE_WRITE;
-  ASSERT_EQ(Sfs->OpenVolume(Sfs, &Root), EFI_SUCCESS);
-  ASSERT_EQ(Root->Open(Root, &Dir, u"\\Logs", Create, EFI_FILE_DIRECTORY), EFI_SUCCESS);
-  ASSERT_EQ(Dir->Open(Dir, &File, u"Report.TXT", Create, 0), EFI_SUCCESS);
-  std::string Data = "hello world";
-  UINTN Size = Data.size();
-  EXPECT_EQ(File->Write(File, &Size, Data.data()), EFI_SUCCESS);
-  EXPECT_EQ(File->SetPosition(File, 6), EFI_SUCCESS);
-  char Buffer[32] = {};
-  Size = sizeof Buffer;
-  EXPECT_EQ(File->Read(File, &Size, Buffer), EFI_SUCCESS);
-  EXPECT_EQ(std::string(Buffer, Size), "world");
-  Size = sizeof Buffer; // at the end: success with nothing; past it: an error
-  EXPECT_EQ(File->Read(File, &Size, Buffer), EFI_SUCCESS);
-  EXPECT_EQ(Size, 0u);
-  EXPECT_EQ(File->SetPosition(File, 20), EFI_SUCCESS);
-  EXPECT_EQ(File->Read(File, &Size, Buffer), EFI_DEVICE_ERROR);
-  EXPECT_EQ(File->SetPosition(File, 0xFFFFFFFFFFFFFFFFULL), EFI_SUCCESS); // the end
-  Size = 1;
-  EXPECT_EQ(File->Write(File, &Size, const_cast<char *>("!")), EFI_SUCCESS);
-  EXPECT_EQ(ReadFile(RamfsDir + "/Logs/Report.TXT"), "hello world!");
-  // Names match whatever their case; "." and ".." walk as in a path.
-  ASSERT_EQ(Root->Open(Root, &Again, u"\\LOGS\\.\\..\\logs\\report.txt", EFI_FILE_MODE_READ, 0),
-            EFI_SUCCESS);
-  EXPECT_EQ(Again->Write(Again, &Size, Buffer), EFI_ACCESS_DENIED);
-  EXPECT_EQ(Again->Close(Again), EFI_SUCCESS);
-  EXPECT_EQ(Root->Open(Root, &Again, u"\\none\\x.txt", Create, 0), EFI_NOT_FOUND);
-  EXPECT_EQ(Root->Open(Root, &Again, u"\\Logs", EFI_FILE_MODE_WRITE, 0), EFI_INVALID_PARAMETER);
-  EXPECT_EQ(File->Delete(File), EFI_SUCCESS);
-  EXPECT_EQ(Dir->Delete(Dir), EFI_SUCCESS); // empty again
-  EXPECT_FALSE(std::filesystem::exists(RamfsDir + "/Logs"));
-  EXPECT_EQ(Root->Delete(Root), EFI_WARN_DELETE_FAILURE); // the root stays, its handle goes
 }
 
 } // namespace

@@ -114,17 +114,6 @@ TEST_F(MainTest, MountFailureIsRecordedAndTheUnmountDecidesTheExitValue) {
   EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
 }
 
-TEST_F(MainTest, EntryRemovesItsRecordsFromTheImageHandle) {
-  RunImage({"CIFSDrv.efi", "a", "b"});
-  void *Interface = nullptr;
-  EXPECT_NE(gBS->HandleProtocol(HostImageHandle(), &gEfiDriverBindingProtocolGuid, &Interface),
-            EFI_SUCCESS);
-  EXPECT_NE(gBS->HandleProtocol(HostImageHandle(), &gEfiComponentNameProtocolGuid, &Interface),
-            EFI_SUCCESS);
-  EXPECT_NE(gBS->HandleProtocol(HostImageHandle(), &gEfiDevicePathProtocolGuid, &Interface),
-            EFI_SUCCESS);
-}
-
 TEST_F(MainTest, DriverBindingPublishesTheStaticMountProtocolOnce) {
   ASSERT_EQ(InstallImageProtocols(HostImageHandle()), EFI_SUCCESS);
   UINTN Count = 0;

@@ -109,27 +109,6 @@ TEST_F(Smb2ConnectMockTest, ConnectAndDisconnectOnDialect210) {
   }
 }
 
-// On 2.0.2 nothing is charged; the server's grant and security mode are
-// adopted (3 = signing required is accepted; the client never signs).
-TEST_F(Smb2ConnectMockTest, Dialect202OverIPv6) {
-  Server S(Server::Family::V6);
-  Use("::1", "share", "CIFSTEST");
-  S.ExpectRequest().Send(NegotiateResponse(0x0202, 3, 0, 0x10000, 1));
-  S.ExpectRequest().Send(ChallengeReply()).ExpectRequest().Send(AuthReply());
-  S.ExpectRequest().Send(TreeReply()).ScriptDisconnect();
-  ASSERT_EQ(Connect(S), EFI_SUCCESS);
-  EXPECT_EQ(+TransactDetails.DialectRevision, 0x0202);
-  EXPECT_EQ(+TransactDetails.CreditRequest, 1);
-  EXPECT_EQ(+TransactDetails.SecurityMode, 3);
-  EXPECT_EQ(Share.MaxReadSize, 0x10000u);
-  ASSERT_EQ(Disconnect(), EFI_SUCCESS);
-  S.Join();
-  std::vector<Bytes> R = S.Requests();
-  ASSERT_EQ(R.size(), 6u);
-  EXPECT_EQ(R[1][71], 3);
-  EXPECT_EQ(CreditCharge(R[3]), 0);
-}
-
 TEST_F(Smb2ConnectMockTest, RefusedDialects) {
   struct Case {
     uint16_t Dialect;
