@@ -36,13 +36,6 @@ e2e_seed_text_fields
 e2e_cifsdrv G 'updates\v2\'
 check_catalog "G with a directory" 'CIFS:\updates\v2' 2 catalog.xml.gz updates/v2/catalog.xml.gz
 
-e2e_fresh
-e2e_share_put other/catalog.xml.gz
-e2e_cifsdrv G
-e2e_check_run "none present"
-e2e_check "none present: exit value 0" test "$E2E_RC" -eq 0
-e2e_verify_status "none present" 0e
-
 # G then S in two runs: the second finds what the first remembered.
 e2e_fresh
 e2e_share_put catalog/catalog.xml.gz "gz"

@@ -60,13 +60,6 @@ TEST_F(ExportTest, SourceTypesAreClassifiedWholeExceptTheReportPrefix) {
   }
 }
 
-TEST_F(ExportTest, RejectedSourceTypeAllocatesNothing) {
-  std::string Out;
-  EXPECT_EQ(Export(u"dgr", nullptr, NWFS_SHARE_TYPE_CIFS, &Out), EFI_INVALID_PARAMETER);
-  EXPECT_EQ(Out, "entering in to ExporttoNWShare()\n\nInvalid: Sourcetype");
-  ExpectNoPoolLeak();
-}
-
 TEST_F(ExportTest, ShareWithoutDriveNameIsNotFound) {
   Share.Uninstall();
   fs::create_directories(RamfsDir);
@@ -91,14 +84,6 @@ TEST_F(ExportTest, CompressedLogIsTakenWhenThePlainOneIsAbsent) {
   EXPECT_TRUE(std::regex_match(Names[0], std::regex(R"(NoAssetTag_VelmorLog_D.*_T.*\.xml\.gz)")))
       << Names[0];
   EXPECT_NE(Out.find("DestPath CIFS:\\ \n"), std::string::npos);
-  ExpectNoPoolLeak();
-}
-
-TEST_F(ExportTest, MissingLogIsNotFoundAndNothingIsWritten) {
-  std::string Out;
-  EXPECT_EQ(Export(u"VML", nullptr, NWFS_SHARE_TYPE_CIFS, &Out), EFI_NOT_FOUND);
-  EXPECT_NE(Out.find("VelmorLog file not found in ramfs!"), std::string::npos);
-  EXPECT_TRUE(SharedFiles().empty());
   ExpectNoPoolLeak();
 }
 
@@ -162,15 +147,6 @@ TEST_F(ExportTest, TechnicalSupportReportExportsEveryFileUnderItsName) {
   ExpectNoPoolLeak();
 }
 
-TEST_F(ExportTest, TechnicalSupportWithoutReportIsNotFound) {
-  std::string Out;
-  EXPECT_EQ(Export(u"DGR", nullptr, NWFS_SHARE_TYPE_CIFS, &Out), EFI_NOT_FOUND);
-  fs::create_directories(RamfsDir + "/TSReport");
-  EXPECT_EQ(Export(u"DGR", nullptr, NWFS_SHARE_TYPE_CIFS, &Out), EFI_NOT_FOUND);
-  EXPECT_NE(Out.find("Technical support report not found in ramfs:\\TSReport!"), std::string::npos);
-  ExpectNoPoolLeak();
-}
-
 // ---------------------------------------------------------------------------
 // SMBIOS asset tag
 // ---------------------------------------------------------------------------
@@ -214,15 +190,6 @@ std::string AssetTagOf(const std::vector<UINT8> &Table, EFI_STATUS *Status, size
   *Status = SmbiosFindChassisAssetTag(Table.data(), Length != 0 ? Length : Table.size(), Tag,
                                       sizeof(Tag));
   return Tag;
-}
-
-TEST_F(ExportTest, ChassisAssetTagIsFoundBehindOtherStructures) {
-  std::vector<UINT8> Table =
-      Join({Structure(0, {1, 2, 0, 0}, {"Vendor", "1.0"}), Structure(2, {}, {}),
-            Chassis(3, {"Maker", "Serial", "ABC-123 x/y"}), Structure(127, {}, {})});
-  EFI_STATUS Status;
-  EXPECT_EQ(AssetTagOf(Table, &Status), "ABC-123_x_y");
-  EXPECT_EQ(Status, EFI_SUCCESS);
 }
 
 TEST_F(ExportTest, MalformedSmbiosTablesAreRejectedWithinTheirBounds) {
@@ -324,22 +291,6 @@ TEST_F(ExportTest, TimeStampsMustBeRealTimes) {
         "+024-01-01T00:00:00", "1899-12-31T00:00:00"}) {
     EXPECT_EQ(ParseXmlTimeStamp(Bad, &Time), EFI_INVALID_PARAMETER) << Bad;
   }
-}
-
-TEST_F(ExportTest, SysInfoGivesServiceTagAndTimeStamp) {
-  CHAR8 Tag[EXPORT_TAG_CHARS];
-  EFI_TIME Time = {};
-  WriteFile(RamfsDir + "/sysInfo.xml", kSysInfo);
-  ASSERT_EQ(ReadSysInfo(Tag, sizeof(Tag), &Time), EFI_SUCCESS);
-  EXPECT_STREQ(Tag, "7XK4Q2R");
-  EXPECT_EQ(Time.Year, 2024);
-  EXPECT_EQ(Time.Second, 9);
-  // Too large to be believed.
-  WriteFile(RamfsDir + "/sysInfo.xml", std::string(SYSINFO_MAX_BYTES + 1, ' ') + kSysInfo);
-  Console([&] { EXPECT_EQ(ReadSysInfo(Tag, sizeof(Tag), &Time), EFI_INVALID_PARAMETER); });
-  fs::remove(RamfsDir + "/sysInfo.xml");
-  Console([&] { EXPECT_EQ(ReadSysInfo(Tag, sizeof(Tag), &Time), EFI_NOT_FOUND); });
-  ExpectNoPoolLeak();
 }
 
 } // namespace

@@ -166,18 +166,6 @@ TEST_F(ProvisioningVarsTest, TextFieldRecordWithoutPlatformStatusOrVariableIsNul
   EXPECT_EQ(ReadVar(PU_PROVISIONING_VAR_NAME, gPUProvisioningEnvGuid).Data, Bytes(Stored));
 }
 
-TEST_F(ProvisioningVarsTest, TextFieldRecordSetRefusesCorruptedFields) {
-  PU_PROVISIONING_RECORD Record = ValidRecord();
-  Record.Text6[0] = 0x0A;
-  Console([&] { EXPECT_EQ(SetPUProvisioningEnvVar(&Record), EFI_INVALID_PARAMETER); });
-  EXPECT_EQ(ReadVar(PU_PROVISIONING_VAR_NAME, gPUProvisioningEnvGuid).Status, EFI_NOT_FOUND);
-  Record.Text6[0] = 'k';
-  Console([&] { EXPECT_EQ(SetPUProvisioningEnvVar(&Record), EFI_SUCCESS); });
-  Variable Stored = ReadVar(PU_PROVISIONING_VAR_NAME, gPUProvisioningEnvGuid);
-  EXPECT_EQ(Stored.Data, Bytes(Record));
-  EXPECT_EQ(Stored.Attributes, 3u);
-}
-
 TEST_F(ProvisioningVarsTest, PlatformStatusRequestAndAnswer) {
   UINT8 First = 0xEE, Second = 0xEE;
   std::string Out = Console([&] { EXPECT_EQ(GetPMStatus(&First, &Second), EFI_NOT_FOUND); });
