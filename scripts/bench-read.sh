@@ -4,9 +4,10 @@
 #
 #   bash scripts/bench-read.sh [SIZE_MIB] [--profile]
 #
-# Builds a non-sanitized Release tree (build/bench-read), writes a file of
-# SIZE_MIB MiB (default 256) into the share, reads it five times through
-# GEE_NWFRead in 1 MiB calls (the largest read the volume makes) and five
+# Builds a non-sanitized Release tree (build/bench-read) with the benchmark
+# program scripts/bench/BenchRead.cpp, writes a file of SIZE_MIB MiB
+# (default 256) into the share, reads it five times through GEE_NWFRead in
+# 1 MiB calls (the largest read the volume makes) and five
 # times with "smbclient -m SMB2_10 -c 'get FILE /dev/null'", and prints
 # each time and the two medians. With --profile it also runs one read of a
 # 32 MiB file under callgrind and prints where the instructions go.
@@ -28,8 +29,11 @@ export SMB_STATE_DIR=$STATE_DIR SMB_MIN_PROTO=SMB2_02 SMB_MAX_PROTO=SMB2_10
 export SMB_USER=$USER_NAME SMB_PASS=$PASSWORD SMB_SHARE=$SHARE SMB_DIR=$SHARE_DIR
 
 echo "== Release build without sanitizers ($BUILD)"
-cmake -S . -B "$BUILD" -G Ninja -DCIFSDRV_SANITIZE=OFF -DCMAKE_BUILD_TYPE=Release >/dev/null
-ninja -C "$BUILD" -j2 integration_tests >/dev/null
+cmake -S . -B "$BUILD" -G Ninja -DCIFSDRV_SANITIZE=OFF -DCIFSDRV_BENCH=ON \
+  -DCMAKE_BUILD_TYPE=Release >/dev/null
+ninja -C "$BUILD" -j2 bench-read >/dev/null
+BENCH=("$BUILD/bench-read" 127.0.0.1 "$SHARE" "$USER_NAME" "$PASSWORD")
+trap 'bash scripts/samba-test-server.sh stop' EXIT
 
 echo "== Samba and a ${SIZE_MIB} MiB file"
 bash scripts/samba-test-server.sh start
@@ -43,12 +47,9 @@ cat "$SHARE_DIR/$FILE" >/dev/null
 median() { sort -g | awk '{ v[NR] = $1 } END { print v[int((NR + 1) / 2)] }'; }
 
 echo "== GEE_NWFRead"
-CIFSDRV_BENCH_FILE=$FILE "$BUILD/tests/integration_tests" --gtest_also_run_disabled_tests \
-  --gtest_filter='*DISABLED_ReadThroughput' | grep '^bench-read:'
+"${BENCH[@]}" "$FILE" $((SIZE_MIB * 1048576)) | grep '^bench-read:'
 
 echo "== smbclient -m SMB2_10 -c 'get $FILE /dev/null'"
-# The test program stops the server when it ends.
-bash scripts/samba-test-server.sh start
 times=()
 for round in 1 2 3 4 5; do
   start=$(date +%s.%N)
@@ -72,11 +73,9 @@ if [ "$PROFILE" = "--profile" ]; then
     head -c $((32 * 1048576)) /dev/urandom >"$SHARE_DIR/$small"
     chown "$USER_NAME" "$SHARE_DIR/$small"
   fi
-  bash scripts/samba-test-server.sh start
   out=$(mktemp /tmp/bench-read-callgrind.XXXXXX)
-  CIFSDRV_BENCH_FILE=$small CIFSDRV_BENCH_ROUNDS=1 valgrind --tool=callgrind \
-    --callgrind-out-file="$out" "$BUILD/tests/integration_tests" --gtest_also_run_disabled_tests \
-    --gtest_filter='*DISABLED_ReadThroughput' >/dev/null 2>&1
+  valgrind --tool=callgrind --callgrind-out-file="$out" \
+    "${BENCH[@]}" "$small" $((32 * 1048576)) 1 >/dev/null 2>&1
   # Instructions spent in the client's own code (the connect's share is
   # mostly the random bytes of the NTLM exchange).
   callgrind_annotate --inclusive=yes "$out" 2>/dev/null |
@@ -84,9 +83,7 @@ if [ "$PROFILE" = "--profile" ]; then
     head -20
   rm -f "$out"
   echo "== wall time in system calls of one read of $SIZE_MIB MiB (strace -w -c, client only)"
-  bash scripts/samba-test-server.sh start
-  CIFSDRV_BENCH_FILE=$FILE CIFSDRV_BENCH_ROUNDS=1 strace -w -c -o /tmp/bench-read-strace.txt \
-    "$BUILD/tests/integration_tests" --gtest_also_run_disabled_tests \
-    --gtest_filter='*DISABLED_ReadThroughput' | grep '^bench-read:'
+  strace -w -c -o /tmp/bench-read-strace.txt "${BENCH[@]}" "$FILE" $((SIZE_MIB * 1048576)) 1 |
+    grep '^bench-read:'
   head -9 /tmp/bench-read-strace.txt
 fi

@@ -6,6 +6,20 @@
 #   e2e_check DESCRIPTION CMD... (passes when CMD succeeds)
 #   e2e_finish                 -> prints "N passed, M failed", exits non-zero on failure
 #
+# The Samba share behind the scripts, and the checks they share:
+#
+#   e2e_share_start              starts Samba on loopback (stopped at exit)
+#   e2e_fresh                    empty share, ramfs: and variable store
+#   e2e_share_put PATH [TEXT]    a file on the share (directories created)
+#   e2e_ramfs_put PATH [TEXT]    a file in ramfs:
+#   e2e_cifsdrv ACTION [ARGS..]  cifsdrv ACTION SHARE 127.0.0.1 USER PASSWORD ARGS
+#   e2e_trade TRADE SOURCE ...   cifsdrv e SHARE 127.0.0.1 TRADE SOURCE USER PASSWORD ...
+#   e2e_check_run NAME           the run left nothing behind and tripped no sanitizer
+#   e2e_verify_status NAME HEX   the outcome record's VerifyStatus byte
+#   e2e_seed_text_fields [PATH]  "PUPROVISIONING_ENV_VAR" with a catalog path
+#   e2e_text_field OFFSET        a text field of that record
+#   e2e_catalog_kind             "CATALOGFILE_ENV_VAR" as a number
+#
 # With CIFSDRV_CONSOLE_LOG set, every run's arguments and console text are
 # appended to that file (for comparing consoles across changes).
 
@@ -58,27 +72,11 @@ e2e_out_lacks() {
   [[ "$E2E_OUT" != *"$1"* ]]
 }
 
-# The console text of the last run holds the line LINE exactly COUNT times.
-e2e_line_count() {
-  local found
-  found=$(printf '%s\n' "$E2E_OUT" | grep -cFx -- "$1")
-  [[ "$found" == "$2" ]]
-}
-
 # Prints "ATTRIBUTES DATA" of a variable in the store, nothing when absent.
 e2e_var() {
   local guid=$1 name=$2
   [[ -f "$CIFSDRV_VARSTORE" ]] || return 0
   awk -v g="{$guid}" -v n="$name" '$1 == g && $2 == n { print $3, $4 }' "$CIFSDRV_VARSTORE"
-}
-
-# The variable exists with ATTRIBUTES and SIZE bytes of data.
-e2e_var_shape() {
-  local value attributes data
-  value=$(e2e_var "$1" "$2")
-  [[ -n "$value" ]] || return 1
-  read -r attributes data <<<"$value"
-  [[ "$((16#$attributes))" == "$3" && "${#data}" == "$(($4 * 2))" ]]
 }
 
 # The variable's data starts with the hex bytes PREFIX.
@@ -88,15 +86,123 @@ e2e_var_starts() {
   [[ "${value#* }" == "$3"* ]]
 }
 
-# The variable's first data byte is not zero.
-e2e_var_first_byte_nonzero() {
-  local value
-  value=$(e2e_var "$1" "$2")
-  [[ -n "$value" && "${value#* }" != 00* ]]
-}
-
 e2e_finish() {
   echo "$E2E_PASSED passed, $E2E_FAILED failed"
   [[ "$E2E_FAILED" == 0 ]]
   exit $?
+}
+
+E2E_REPO=$(cd "$(dirname "${BASH_SOURCE[0]}")/../.." && pwd)
+
+export SMB_USER=cifstest
+export SMB_PASS=Cifs-Test-Pw1
+export SMB_SHARE=cifsshare
+export SMB_DIR=${SMB_STATE_DIR:-/tmp/cifsdrv-samba}/share-e2e
+
+readonly PROVISIONING_GUID=4C4AC96B-DD0A-447E-8118-105900DA8629
+readonly PU_GUID=4D4AC77B-DD0A-447E-8117-104901DA8679
+readonly CATALOG_GUID=806E07A4-AE56-11E1-A464-FE1F6188709B
+readonly DEBUG_GUID=47C7B224-C42A-11D2-8E57-00A0C969723B
+
+# Another test's server may hold the port for a while: wait up to a minute.
+e2e_share_start() {
+  local attempt
+  for attempt in $(seq 30); do
+    if bash "$E2E_REPO/scripts/samba-test-server.sh" start 2>/dev/null; then
+      break
+    fi
+    if [[ "$attempt" == 30 ]]; then
+      echo "e2e: the Samba test server could not be started"
+      exit 2
+    fi
+    sleep 2
+  done
+  trap 'cd /; rm -rf "$E2E_DIR"; bash "$E2E_REPO/scripts/samba-test-server.sh" stop' EXIT
+}
+
+e2e_fresh() {
+  rm -rf "$SMB_DIR" "$CIFSDRV_RAMFS"
+  mkdir -p "$SMB_DIR" "$CIFSDRV_RAMFS"
+  chown "$SMB_USER" "$SMB_DIR"
+  chmod 0777 "$SMB_DIR"
+  e2e_reset_vars
+}
+
+e2e_share_put() {
+  mkdir -p "$(dirname "$SMB_DIR/$1")"
+  printf '%s' "${2:-content of $1}" >"$SMB_DIR/$1"
+  chmod -R a+rwX "$SMB_DIR"
+}
+
+e2e_ramfs_put() {
+  mkdir -p "$(dirname "$CIFSDRV_RAMFS/$1")"
+  printf '%s' "${2:-content of $1}" >"$CIFSDRV_RAMFS/$1"
+}
+
+# Standard layout: cifsdrv ACTION SHARE 127.0.0.1 USER PASSWORD [PATH].
+e2e_cifsdrv() {
+  local action=$1
+  shift
+  e2e_run "$action" "$SMB_SHARE" 127.0.0.1 "$SMB_USER" "$SMB_PASS" "$@"
+}
+
+# Trade layout: cifsdrv e SHARE 127.0.0.1 TRADE SOURCE USER PASSWORD [FILE].
+e2e_trade() {
+  local trade=$1 source=$2
+  shift 2
+  e2e_run e "$SMB_SHARE" 127.0.0.1 "$trade" "$source" "$SMB_USER" "$SMB_PASS" "$@"
+}
+
+e2e_check_run() {
+  e2e_check "$1: no pool block or socket left" e2e_out_lacks "cifsdrv: left behind:"
+  e2e_check "$1: no sanitizer report" e2e_out_lacks "runtime error"
+  e2e_check "$1: no AddressSanitizer report" e2e_out_lacks "AddressSanitizer"
+}
+
+e2e_verify_status() {
+  e2e_check "$1: VerifyStatus $2" e2e_var_starts "$PROVISIONING_GUID" PROVISIONING_ENV_VOLATILE_VAR "$2"
+}
+
+# Hex of TEXT padded with zero bytes to SIZE bytes.
+e2e_hex_field() {
+  local text=$1 size=$2 hex
+  hex=$(printf '%s' "$text" | od -An -tx1 -v | tr -d ' \n')
+  printf '%s' "$hex"
+  printf '%0*d' $((size * 2 - ${#hex})) 0
+}
+
+# Writes the text-field record with the CIFS catalog directory PATH.
+e2e_seed_text_fields() {
+  local data
+  data="$(e2e_hex_field "" 384)$(e2e_hex_field "${1:-}" 128)$(e2e_hex_field "" 640)"
+  echo "{$PU_GUID} PUPROVISIONING_ENV_VAR 3 $data" >>"$CIFSDRV_VARSTORE"
+}
+
+# Runs at the most verbose driver level.
+e2e_seed_verbose() {
+  echo "{$DEBUG_GUID} QVUIkestDebugLevel 3 35" >>"$CIFSDRV_VARSTORE"
+}
+
+e2e_text_field() {
+  local value hex out="" i pair
+  value=$(e2e_var "$PU_GUID" PUPROVISIONING_ENV_VAR)
+  hex=${value#* }
+  hex=${hex:$(($1 * 2)):256}
+  for ((i = 0; i < ${#hex}; i += 2)); do
+    pair=${hex:i:2}
+    [[ "$pair" == "00" ]] && break
+    out+=$(printf "\\x$pair")
+  done
+  printf '%s' "$out"
+}
+
+e2e_catalog_kind() {
+  local value le
+  value=$(e2e_var "$CATALOG_GUID" CATALOGFILE_ENV_VAR)
+  le=${value#* }
+  printf '%d' "$((16#${le:6:2}${le:4:2}${le:2:2}${le:0:2}))"
+}
+
+e2e_same_file() {
+  cmp -s "$1" "$2"
 }

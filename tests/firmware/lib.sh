@@ -175,15 +175,6 @@ fw_check_absent_text() {
   if grep -qF -- "$2" <<<"$1"; then fw_fail "$3 (found \"$2\")"; else fw_pass "$3"; fi
 }
 
-# fw_check_count TEXT LINE COUNT DESCRIPTION [nocase]: LINE occurs as a
-# whole line exactly COUNT times (ignoring case with "nocase").
-fw_check_count() {
-  local n flags=-cxF
-  [ "${5:-}" = nocase ] && flags=-cixF
-  n=$(grep "$flags" -- "$2" <<<"$1" || true)
-  if [ "$n" -eq "$3" ]; then fw_pass "$4"; else fw_fail "$4 (\"$2\" seen $n times, want $3)"; fi
-}
-
 # fw_check_nonzero_lasterror TEXT DESCRIPTION
 fw_check_nonzero_lasterror() {
   local value
@@ -237,38 +228,4 @@ fw_hex_text() {
     out+=$(printf '%b' "\\x$pair")
   done
   printf '%s' "$out"
-}
-
-# fw_stamp_markers LOG OUT: in the background, follows the serial log LOG
-# (which must not exist yet: fw_boot creates it) and writes each "@@" line it
-# sees to OUT, prefixed with this machine's time in seconds. Its process id
-# is left in FW_STAMPER_PID and added to FW_CLEANUP_PIDS.
-fw_stamp_markers() {
-  perl -MTime::HiRes=time,sleep -e '
-    my ($log, $out) = @ARGV;
-    open(my $o, ">", $out) or die "$out: $!";
-    $o->autoflush(1);
-    my $in;
-    sleep 0.05 until open($in, "<", $log);
-    my $pending = "";
-    while (1) {
-      my $n = sysread($in, my $chunk, 65536);
-      if (!$n) { sleep 0.05; next; }
-      $pending .= $chunk;
-      while ($pending =~ s/^([^\n]*)\n//) {
-        my $line = $1;
-        $line =~ s/\e\[[0-9;?=]*[A-Za-z]//g;
-        $line =~ s/[\r\s]+$//;
-        printf $o "%.2f %s\n", time, $line if $line =~ /^@@/;
-      }
-    }
-  ' "$1" "$2" &
-  FW_STAMPER_PID=$!
-  FW_CLEANUP_PIDS+=("$FW_STAMPER_PID")
-}
-
-# fw_marker_time STAMPS LINE: the time at which LINE was first seen.
-fw_marker_time() {
-  [ -f "$1" ] || return 0
-  awk -v want="$2" '{ t = $1; $1 = ""; sub(/^ /, "") } $0 == want { print t; exit }' "$1"
 }

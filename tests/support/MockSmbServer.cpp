@@ -209,36 +209,24 @@ Bytes ErrorResponse(uint16_t Command, uint32_t Status, uint64_t MessageId, uint6
 // ---------------------------------------------------------------------------
 // Server
 // ---------------------------------------------------------------------------
-Server::Server(Family F) {
-  int Domain = F == Family::V4 ? AF_INET : AF_INET6;
-  ListenFd = socket(Domain, SOCK_STREAM | SOCK_CLOEXEC, 0);
+Server::Server() {
+  ListenFd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
   if (ListenFd < 0) {
     Fail("socket failed");
     return;
   }
   int One = 1;
   setsockopt(ListenFd, SOL_SOCKET, SO_REUSEADDR, &One, sizeof(One));
-  sockaddr_storage Storage = {};
-  socklen_t Size;
-  if (F == Family::V4) {
-    sockaddr_in *In = reinterpret_cast<sockaddr_in *>(&Storage);
-    In->sin_family = AF_INET;
-    In->sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    Size = sizeof(sockaddr_in);
-  } else {
-    sockaddr_in6 *In6 = reinterpret_cast<sockaddr_in6 *>(&Storage);
-    In6->sin6_family = AF_INET6;
-    In6->sin6_addr = in6addr_loopback;
-    Size = sizeof(sockaddr_in6);
-  }
-  if (bind(ListenFd, reinterpret_cast<sockaddr *>(&Storage), Size) != 0 ||
-      listen(ListenFd, 1) != 0) {
+  sockaddr_in In = {};
+  In.sin_family = AF_INET;
+  In.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  socklen_t Size = sizeof(In);
+  if (bind(ListenFd, reinterpret_cast<sockaddr *>(&In), Size) != 0 || listen(ListenFd, 1) != 0) {
     Fail("bind/listen failed");
     return;
   }
-  getsockname(ListenFd, reinterpret_cast<sockaddr *>(&Storage), &Size);
-  ListenPort = ntohs(F == Family::V4 ? reinterpret_cast<sockaddr_in *>(&Storage)->sin_port
-                                     : reinterpret_cast<sockaddr_in6 *>(&Storage)->sin6_port);
+  getsockname(ListenFd, reinterpret_cast<sockaddr *>(&In), &Size);
+  ListenPort = ntohs(In.sin_port);
 }
 
 Server::~Server() {

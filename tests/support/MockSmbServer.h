@@ -91,8 +91,7 @@ constexpr uint32_t kTreeId = 0x00000005;
 // ---------------------------------------------------------------------------
 class Server {
 public:
-  enum class Family { V4, V6 };
-  explicit Server(Family F = Family::V4);
+  Server();
   ~Server();
   Server(const Server &) = delete;
   Server &operator=(const Server &) = delete;

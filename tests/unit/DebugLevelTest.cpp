@@ -1,82 +1,28 @@
-// The debug levels, their initialisers and the console lines, with a console
-// that records what is written and runtime services that serve the two level
-// variables from a small map.
-#include "DiagLog.h"
-#include "NwBaseLib.h"
+// The debug levels, their initialisers (the two variables read from the
+// hosted store) and the standard console lines.
+#include "HostImageFixture.h"
 
-#include <gtest/gtest.h>
-
-#include <cstring>
-#include <map>
 #include <regex>
 #include <string>
 
 namespace {
 
-EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL gConsole;
-std::u16string gConsoleText;
-int gConsoleCalls;
-
-EFI_STATUS EFIAPI CaptureOutput(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *, const CHAR16 *String) {
-  gConsoleCalls++;
-  gConsoleText += String;
-  return EFI_SUCCESS;
-}
-
 const EFI_GUID LevelGuid = {
     0x47C7B224, 0xC42A, 0x11D2, {0x8E, 0x57, 0x00, 0xA0, 0xC9, 0x69, 0x72, 0x3B}};
-std::map<std::u16string, std::string> gVariables;
 
-EFI_STATUS EFIAPI ServeVariable(const CHAR16 *Name, const EFI_GUID *Guid, UINT32 *Attributes,
-                                UINTN *DataSize, void *Data) {
-  EXPECT_EQ(*DataSize, 6u);
-  EXPECT_EQ(Attributes, nullptr);
-  auto Found = gVariables.find(Name);
-  if (Found == gVariables.end() || !EfiGuidEqual(*Guid, LevelGuid)) {
-    return EFI_NOT_FOUND;
-  }
-  const UINTN Size = *DataSize;
-  *DataSize = Found->second.size();
-  if (Found->second.size() > Size) {
-    return EFI_BUFFER_TOO_SMALL;
-  }
-  memcpy(Data, Found->second.data(), Found->second.size());
-  return EFI_SUCCESS;
-}
-
-class DiagTest : public ::testing::Test {
+class DebugLevelTest : public HostImageTest {
 protected:
-  void SetUp() override {
-    memset(&System, 0, sizeof(System));
-    memset(&Runtime, 0, sizeof(Runtime));
-    gConsole = {};
-    gConsole.OutputString = CaptureOutput;
-    gConsoleText.clear();
-    gConsoleCalls = 0;
-    gVariables.clear();
-    Runtime.GetVariable = ServeVariable;
-    System.ConOut = &gConsole;
-    gST = &System;
-    gRT = &Runtime;
-  }
   void TearDown() override {
-    gST = SavedST;
-    gRT = SavedRT;
-    gDriverDebugLevel = SavedLevels[0];
-    gSMB2DebugLevel = SavedLevels[1];
-    gTcpDebugLevel = SavedLevels[2];
+    gSMB2DebugLevel = 0;
+    HostImageTest::TearDown();
   }
-  static std::string Console() { return std::string(gConsoleText.begin(), gConsoleText.end()); }
-
-  EFI_SYSTEM_TABLE *SavedST = gST;
-  EFI_RUNTIME_SERVICES *SavedRT = gRT;
-  UINT8 SavedLevels[3] = {gDriverDebugLevel, gSMB2DebugLevel, gTcpDebugLevel};
-  EFI_SYSTEM_TABLE System;
-  EFI_RUNTIME_SERVICES Runtime;
+  // Stores the variable with Data as its text, or deletes it.
+  static void Store(const CHAR16 *Name, const char *Data) {
+    std::string Text = Data != nullptr ? Data : "";
+    gRT->SetVariable(Name, &LevelGuid, 3, Text.size(), Text.data());
+  }
 };
-
-using DebugLevelTest = DiagTest;
-using DiagLogTest = DiagTest;
+using DiagLogTest = DebugLevelTest;
 
 const char *const Absent = nullptr;
 const char *const Clamped = "Debuglevel [-0-9]+ is wrongly set\\. Setting to highest value!\n";
@@ -105,21 +51,17 @@ TEST_F(DebugLevelTest, DriverLevel) {
        FailedLine("QVUIkestDebugLevelInitialize", "5 \\(0x5\\)")},
   };
   for (const auto &Case : Cases) {
-    gVariables.clear();
-    if (Case.Data != nullptr) {
-      gVariables[u"QVUIkestDebugLevel"] = Case.Data;
-    }
-    gConsoleText.clear();
+    Store(u"QVUIkestDebugLevel", Case.Data);
     UINT8 Level = 99;
-    EXPECT_EQ(QVUIkestDebugLevelInitialize(&Level), Case.Status);
+    std::string Out =
+        Console([&] { EXPECT_EQ(QVUIkestDebugLevelInitialize(&Level), Case.Status); });
     EXPECT_EQ(Level, Case.Level) << (Case.Data ? Case.Data : "absent");
-    EXPECT_TRUE(std::regex_match(Console(), std::regex(Case.Console))) << Console();
+    EXPECT_TRUE(std::regex_match(Out, std::regex(Case.Console))) << Out;
   }
-  gVariables[u"QVUIkestDebugLevel"] = "9";
-  gConsoleText.clear();
+  Store(u"QVUIkestDebugLevel", "9");
   UINT8 Level = 0;
-  QVUIkestDebugLevelInitialize(&Level);
-  EXPECT_EQ(Console(), "Debuglevel 9 is wrongly set. Setting to highest value!\n");
+  EXPECT_EQ(Console([&] { QVUIkestDebugLevelInitialize(&Level); }),
+            "Debuglevel 9 is wrongly set. Setting to highest value!\n");
 }
 
 TEST_F(DebugLevelTest, Smb2Level) {
@@ -142,30 +84,14 @@ TEST_F(DebugLevelTest, Smb2Level) {
       {"1234567", 4, 0, EFI_BUFFER_TOO_SMALL, ""}, // other failures read 0
   };
   for (const auto &Case : Cases) {
-    gVariables.clear();
-    if (Case.Data != nullptr) {
-      gVariables[u"SMB2DebugLevel"] = Case.Data;
-    }
-    gConsoleText.clear();
+    Store(u"SMB2DebugLevel", Case.Data);
     gSMB2DebugLevel = Case.Before;
     UINT8 Level = 99;
-    EXPECT_EQ(SMB2DebugLevelInitialize(&Level), Case.Status);
+    std::string Out = Console([&] { EXPECT_EQ(SMB2DebugLevelInitialize(&Level), Case.Status); });
     EXPECT_EQ(Level, Case.Level) << (Case.Data ? Case.Data : "absent") << " " << +Case.Before;
     EXPECT_EQ(gSMB2DebugLevel, Case.Level);
-    EXPECT_TRUE(std::regex_match(Console(), std::regex(Case.Console))) << Console();
+    EXPECT_TRUE(std::regex_match(Out, std::regex(Case.Console))) << Out;
   }
-}
-
-TEST_F(DebugLevelTest, NoRuntimeServices) {
-  gRT = nullptr;
-  gSMB2DebugLevel = 4;
-  UINT8 Driver = 3;
-  UINT8 Smb2 = 3;
-  EXPECT_EQ(QVUIkestDebugLevelInitialize(&Driver), EFI_INVALID_PARAMETER);
-  EXPECT_EQ(SMB2DebugLevelInitialize(&Smb2), EFI_INVALID_PARAMETER);
-  EXPECT_EQ(Driver, 0);
-  EXPECT_EQ(Smb2, 0);
-  EXPECT_EQ(Console(), "RT variable is NULL!\nRT variable is NULL!\n");
 }
 
 TEST_F(DiagLogTest, StandardLines) {
@@ -173,77 +99,33 @@ TEST_F(DiagLogTest, StandardLines) {
   static_assert(DiagStatusNumber(EFI_SUCCESS) == 0 && DiagStatusValue(EFI_SUCCESS) == 0);
   gDriverDebugLevel = 5;
   gSMB2DebugLevel = 2;
-  DiagError("\nGetVariable returned", EFI_NOT_FOUND, "main", 221);
-  DiagError("ok", EFI_SUCCESS, "MountStaticFileSystem", 7);
-  DiagEntry(DiagChannel::Driver, "main", 10);
-  DiagExit(EFI_NOT_FOUND, DiagChannel::Smb2, "SMB2_Connect", 20);
-  DiagShortEntry(DiagChannel::Driver, "MountStaticFileSystem");
-  DiagShortExit(EFI_NOT_FOUND, ',', DiagChannel::Driver, "MountStaticFileSystem");
-  DiagShortExit(EFI_SUCCESS, '.', DiagChannel::Driver, "UnmountStaticFileSystem");
-  DiagNullInput(DiagChannel::Smb2, "SMB2HeaderConstruct", 9);
-  DiagGuid(DIAG_VERBOSE, nullptr, LevelGuid);
-  DiagGuid(DIAG_VERBOSE, "main (221): ", LevelGuid);
-  EXPECT_EQ(Console(),
-            "Function: main, Line no.: = 221 - \nGetVariable returned, Status = 14 (0xe)\n"
-            "Function: MountStaticFileSystem, Line no.: = 7 - ok, Status = 0 (0x0)\n"
-            "\nFunction: main, Line no.: = 10. Entered\n"
-            "Function: SMB2_Connect, Line no.: = 20. Exiting! Status = 14 (0xe)\n"
-            "Entering MountStaticFileSystem\n"
-            "Exiting MountStaticFileSystem, Status = 0xe\n"
-            "Exiting UnmountStaticFileSystem. Status = 0x0\n"
-            "Function: SMB2HeaderConstruct, Line no.: = 9, Input parameter is NULL!\n"
-            "Guid = {47C7B224-C42A-11D2-8E57-00A0C969723B}\n"
-            "main (221): Guid = {47C7B224-C42A-11D2-8E57-00A0C969723B}\n");
+  std::string Out = Console([] {
+    DiagError("\nGetVariable returned", EFI_NOT_FOUND, "main", 221);
+    DiagError("ok", EFI_SUCCESS, "MountStaticFileSystem", 7);
+    DiagEntry(DiagChannel::Driver, "main", 10);
+    DiagExit(EFI_NOT_FOUND, DiagChannel::Smb2, "SMB2_Connect", 20);
+    DiagShortEntry(DiagChannel::Driver, "MountStaticFileSystem");
+    DiagShortExit(EFI_NOT_FOUND, ',', DiagChannel::Driver, "MountStaticFileSystem");
+    DiagShortExit(EFI_SUCCESS, '.', DiagChannel::Driver, "UnmountStaticFileSystem");
+    DiagNullInput(DiagChannel::Smb2, "SMB2HeaderConstruct", 9);
+    DiagGuid(DIAG_VERBOSE, nullptr, LevelGuid);
+    DiagGuid(DIAG_VERBOSE, "main (221): ", LevelGuid);
+  });
+  EXPECT_EQ(Out, "Function: main, Line no.: = 221 - \nGetVariable returned, Status = 14 (0xe)\n"
+                 "Function: MountStaticFileSystem, Line no.: = 7 - ok, Status = 0 (0x0)\n"
+                 "\nFunction: main, Line no.: = 10. Entered\n"
+                 "Function: SMB2_Connect, Line no.: = 20. Exiting! Status = 14 (0xe)\n"
+                 "Entering MountStaticFileSystem\n"
+                 "Exiting MountStaticFileSystem, Status = 0xe\n"
+                 "Exiting UnmountStaticFileSystem. Status = 0x0\n"
+                 "Function: SMB2HeaderConstruct, Line no.: = 9, Input parameter is NULL!\n"
+                 "Guid = {47C7B224-C42A-11D2-8E57-00A0C969723B}\n"
+                 "main (221): Guid = {47C7B224-C42A-11D2-8E57-00A0C969723B}\n");
 
-  gConsoleText.clear();
   const UINT32 Line = __LINE__ + 1;
-  DiagError("x", EFI_ABORTED);
-  EXPECT_EQ(Console(), "Function: TestBody, Line no.: = " + std::to_string(Line) +
-                           " - x, Status = 21 (0x15)\n");
-}
-
-TEST_F(DiagLogTest, EachChannelHasItsOwnLevel) {
-  gDriverDebugLevel = 1;
-  gSMB2DebugLevel = 5;
-  gTcpDebugLevel = 0;
-  DiagLog(DIAG_ALWAYS, "a");
-  DiagLog(DIAG_MISMATCH, "b");
-  DiagLog(DIAG_TRACE, "X");
-  DiagLogW(DIAG_TRACE, u"X");
-  DiagEntry(DiagChannel::Driver, "X", 1);
-  DiagShortExit(EFI_SUCCESS);
-  DiagGuid(DIAG_VERBOSE, nullptr, LevelGuid);
-  Smb2Log(DIAG_VERBOSE, "c");
-  Smb2Log(DIAG_DUMP, "X");
-  DiagErrorAt(DiagChannel::Smb2, DIAG_DUMP, "X", EFI_ABORTED, "f", 1);
-  TcpLog(DIAG_ALWAYS, "d");
-  TcpLog(DIAG_TRACE, "X");
-  gDriverDebugLevel = 0;
-  DiagError("e", EFI_ABORTED, "g", 2); // error lines print whatever the level
-  EXPECT_EQ(Console(), "abcdFunction: g, Line no.: = 2 - e, Status = 21 (0x15)\n");
-}
-
-TEST_F(DiagLogTest, WideFormatsLongLinesAndNoConsole) {
-  gDriverDebugLevel = 5;
-  DiagLogW(DIAG_VERBOSE, u"driveName = %s, %a\n", u"fs0\u00e9", "x");
-  EXPECT_EQ(gConsoleText, u"driveName = fs0\u00e9, x\n");
-
-  // A long line arrives whole, unchanged (no CR added), in a few writes.
-  gConsoleText.clear();
-  gConsoleCalls = 0;
-  const std::string Long(2000, 'q');
-  DiagLog(DIAG_ALWAYS, "<%s>\n", Long.c_str());
-  EXPECT_EQ(Console(), "<" + Long + ">\n");
-  EXPECT_GE(gConsoleCalls, 2);
-  EXPECT_LE(gConsoleCalls, 10);
-
-  gConsoleCalls = 0;
-  System.ConOut = nullptr;
-  DiagLog(DIAG_ALWAYS, "x");
-  DiagError("x", EFI_ABORTED, "f", 1);
-  gST = nullptr;
-  DiagLogW(DIAG_ALWAYS, u"x");
-  EXPECT_EQ(gConsoleCalls, 0);
+  Out = Console([] { DiagError("x", EFI_ABORTED); });
+  EXPECT_EQ(Out, "Function: operator(), Line no.: = " + std::to_string(Line) +
+                     " - x, Status = 21 (0x15)\n");
 }
 
 } // namespace

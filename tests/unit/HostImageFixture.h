@@ -116,10 +116,6 @@ protected:
     std::ifstream In(Path, std::ios::binary);
     return std::string(std::istreambuf_iterator<char>(In), {});
   }
-  static std::vector<UINT8> ReadBytes(const std::string &Path) {
-    std::string Text = ReadFile(Path);
-    return {Text.begin(), Text.end()};
-  }
   static void WriteFile(const std::string &Path, const std::string &Text) {
     std::filesystem::create_directories(std::filesystem::path(Path).parent_path());
     std::ofstream(Path, std::ios::binary) << Text;

@@ -111,35 +111,7 @@ TEST_F(MainTest, MountFailureIsRecordedAndTheUnmountDecidesTheExitValue) {
   EXPECT_EQ(Outcome.Data[0], MountError);
   EXPECT_TRUE(std::equal(Preset.begin() + 1, Preset.end(), Outcome.Data.begin() + 1));
 
-  Variable Created = ReadVar(PROVISIONING_VOLATILE_VAR_NAME, gProvisioningVolatileInitGuid);
-  EXPECT_EQ(Created.Data, std::vector<UINT8>(40, 0));
-  EXPECT_EQ(Created.Attributes, PROVISIONING_VOLATILE_ATTRIBUTES);
-  Variable Settings = ReadVar(PROVISIONING_ENV_VAR_NAME, gProvisioningEnvGuid);
-  ASSERT_EQ(Settings.Data.size(), 396u);
-  EXPECT_EQ(Settings.Attributes, PROVISIONING_NV_ATTRIBUTES);
-  EXPECT_STREQ(reinterpret_cast<const char *>(Settings.Data.data() + 140),
-               PROVISIONING_DOWNLOAD_HOST);
   EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
-}
-
-TEST_F(MainTest, ImageNameAloneOnlyRecordsTheOutcome) {
-  std::string Out;
-  EXPECT_EQ(RunImage({"CIFSDrv.efi"}, &Out), EFI_SUCCESS);
-  EXPECT_EQ(Out.find("Entering into IPMI Library"), std::string::npos);
-  EXPECT_EQ(Out.find("Mismatch"), std::string::npos);
-  EXPECT_EQ(VerifyStatus(), 0);
-  EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
-}
-
-TEST_F(MainTest, EntryRemovesItsRecordsFromTheImageHandle) {
-  RunImage({"CIFSDrv.efi", "a", "b"});
-  void *Interface = nullptr;
-  EXPECT_NE(gBS->HandleProtocol(HostImageHandle(), &gEfiDriverBindingProtocolGuid, &Interface),
-            EFI_SUCCESS);
-  EXPECT_NE(gBS->HandleProtocol(HostImageHandle(), &gEfiComponentNameProtocolGuid, &Interface),
-            EFI_SUCCESS);
-  EXPECT_NE(gBS->HandleProtocol(HostImageHandle(), &gEfiDevicePathProtocolGuid, &Interface),
-            EFI_SUCCESS);
 }
 
 TEST_F(MainTest, DriverBindingPublishesTheStaticMountProtocolOnce) {

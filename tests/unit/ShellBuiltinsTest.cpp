@@ -118,21 +118,6 @@ TEST_F(ShellBuiltinsTest, CopiesAreByteIdenticalAcrossVolumes) {
   EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
 }
 
-TEST_F(ShellBuiltinsTest, FailedCopiesAndDeletesReportTheirStatus) {
-  EXPECT_EQ(Run(u"cp -q CIFS:\\catalog\\missing.bin ramfs:\\"), EFI_NOT_FOUND);
-  EXPECT_FALSE(fs::exists(RamfsDir + "/missing.bin"));
-  // A directory is not copied, and nothing is created for it.
-  EXPECT_TRUE(EFI_ERROR(Run(u"cp -q CIFS:\\catalog ramfs:\\")));
-  EXPECT_FALSE(fs::exists(RamfsDir + "/catalog"));
-
-  WriteFile(RamfsDir + "/old.txt", "old");
-  EXPECT_EQ(Run(u"del -q ramfs:\\old.txt"), EFI_SUCCESS);
-  EXPECT_FALSE(fs::exists(RamfsDir + "/old.txt"));
-  EXPECT_TRUE(EFI_ERROR(Run(u"del -q ramfs:\\old.txt")));
-  EXPECT_EQ(gExecuteCalls, 0);
-  EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
-}
-
 TEST_F(ShellBuiltinsTest, OtherCommandsAndNonNestingShellsUseExecute) {
   // Forms the image does not carry out itself still reach the shell.
   Run(u"map -d ALIAS:");

@@ -134,16 +134,6 @@ protected:
   std::vector<FakeVolume *> Installed;
 };
 
-TEST_F(ShellCommandTest, WithoutShellBindingOrCommandOnlyTheLetterCIsShown) {
-  gDriverDebugLevel = 0;
-  std::string Out =
-      Console([] { EXPECT_EQ(ExecuteShellCommand(u"map -u"), EFI_INVALID_PARAMETER); });
-  EXPECT_EQ(Out, "C");
-  Bind();
-  Out = Console([] { EXPECT_EQ(ExecuteShellCommand(nullptr), EFI_INVALID_PARAMETER); });
-  EXPECT_EQ(Out, "C");
-}
-
 TEST_F(ShellCommandTest, ExecuteReportsTheCommandsOwnStatus) {
   Bind();
   EXPECT_TRUE(gShellEnv2Found);
@@ -151,19 +141,6 @@ TEST_F(ShellCommandTest, ExecuteReportsTheCommandsOwnStatus) {
   EXPECT_NE(Out.find("\nCommand Success: ..\n"), std::string::npos);
   Out = Console([] { EXPECT_TRUE(EFI_ERROR(ExecuteShellCommand(u"del -q ramfs:\\missing.txt"))); });
   EXPECT_NE(Out.find("\nCommand Failed: Status = "), std::string::npos);
-  EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
-}
-
-TEST_F(ShellCommandTest, RunnerSeparatesLaunchFromCommandStatus) {
-  Console([] {
-    EXPECT_EQ(RunShellCommand(nullptr), 1);
-    EXPECT_EQ(RunShellCommand(u"map -u"), 0);
-    EXPECT_EQ(gLastCommandStatus, EFI_SUCCESS);
-    EXPECT_EQ(RunShellCommand(u"nosuchcommand"), -1);
-    EXPECT_TRUE(EFI_ERROR(gLastCommandStatus));
-    EXPECT_EQ(RunShellCommandAscii("del -q ramfs:\\missing.txt"), 0);
-    EXPECT_TRUE(EFI_ERROR(gLastCommandStatus));
-  });
   EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
 }
 
@@ -261,18 +238,6 @@ TEST_F(ShellCommandTest, LongOrCarelessLabelsAreReadWithinTheirBuffer) {
   EXPECT_NE(Out.find("RootFs->GetInfo return Buffer small"), std::string::npos);
   EXPECT_NE(Out.find("partitionLabel = ABCDEFGHIJKLMNOPQRST\n"), std::string::npos);
   EXPECT_EQ(Careless->OpenRoots, 0);
-  EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
-}
-
-TEST_F(ShellCommandTest, RefreshNamesNewVolumesWithoutTouchingTheConsole) {
-  Bind();
-  FakeVolume *Fresh = AddVolume(u"FRESH", 0x03);
-  EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *ConOut = gST->ConOut;
-  std::string Out = Console([] { RefreshShellMappings(); });
-  EXPECT_EQ(Out, "");
-  EXPECT_EQ(gST->ConOut, ConOut);
-  EFI_DEVICE_PATH_PROTOCOL *Cursor = &Fresh->Path.Header;
-  EXPECT_NE(gShellEnv2->GetMapFromDevicePath(&Cursor), nullptr);
   EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
 }
 
