@@ -11,8 +11,8 @@
 #include <stdint.h>
 
 struct HostConfig {
-  const char *RamfsDir = nullptr;  // backs ramfs:; default "./ramfs", created if missing
-  const char *VarStore = nullptr;  // variable store file; default "./cifsdrv-vars.txt"
+  const char *RamfsDir = nullptr; // backs ramfs:; default "./ramfs", created if missing
+  const char *VarStore = nullptr; // variable store file; default "./cifsdrv-vars.txt"
 };
 
 // Builds the system table and installs the environment's protocols (shell,

@@ -63,8 +63,12 @@ inline bool EfiGuidEqual(const EFI_GUID &A, const EFI_GUID &B) {
 // Status codes
 // ---------------------------------------------------------------------------
 constexpr EFI_STATUS EFI_ERROR_BIT = 0x8000000000000000ULL;
-constexpr EFI_STATUS EfiErr(UINTN N) { return EFI_ERROR_BIT | N; }
-constexpr bool EFI_ERROR(EFI_STATUS S) { return (S & EFI_ERROR_BIT) != 0; }
+constexpr EFI_STATUS EfiErr(UINTN N) {
+  return EFI_ERROR_BIT | N;
+}
+constexpr bool EFI_ERROR(EFI_STATUS S) {
+  return (S & EFI_ERROR_BIT) != 0;
+}
 
 constexpr EFI_STATUS EFI_SUCCESS = 0;
 constexpr EFI_STATUS EFI_LOAD_ERROR = EfiErr(1);
@@ -306,8 +310,7 @@ struct EFI_BOOT_SERVICES {
   EFI_STATUS(EFIAPI *CloseEvent)(EFI_EVENT Event);
   EFI_STATUS(EFIAPI *CheckEvent)(EFI_EVENT Event);
   EFI_STATUS(EFIAPI *InstallProtocolInterface)
-  (EFI_HANDLE *Handle, const EFI_GUID *Protocol, EFI_INTERFACE_TYPE InterfaceType,
-   void *Interface);
+  (EFI_HANDLE *Handle, const EFI_GUID *Protocol, EFI_INTERFACE_TYPE InterfaceType, void *Interface);
   EFI_STATUS(EFIAPI *ReinstallProtocolInterface)
   (EFI_HANDLE Handle, const EFI_GUID *Protocol, void *OldInterface, void *NewInterface);
   EFI_STATUS(EFIAPI *UninstallProtocolInterface)
@@ -317,8 +320,8 @@ struct EFI_BOOT_SERVICES {
   EFI_STATUS(EFIAPI *RegisterProtocolNotify)
   (const EFI_GUID *Protocol, EFI_EVENT Event, void **Registration);
   EFI_STATUS(EFIAPI *LocateHandle)
-  (EFI_LOCATE_SEARCH_TYPE SearchType, const EFI_GUID *Protocol, void *SearchKey,
-   UINTN *BufferSize, EFI_HANDLE *Buffer);
+  (EFI_LOCATE_SEARCH_TYPE SearchType, const EFI_GUID *Protocol, void *SearchKey, UINTN *BufferSize,
+   EFI_HANDLE *Buffer);
   EFI_STATUS(EFIAPI *LocateDevicePath)
   (const EFI_GUID *Protocol, EFI_DEVICE_PATH_PROTOCOL **DevicePath, EFI_HANDLE *Device);
   EFI_STATUS(EFIAPI *InstallConfigurationTable)(const EFI_GUID *Guid, void *Table);
@@ -438,8 +441,8 @@ constexpr UINT64 EFI_SIMPLE_FILE_SYSTEM_PROTOCOL_REVISION = 0x00010000;
 struct EFI_FILE_PROTOCOL {
   UINT64 Revision;
   EFI_STATUS(EFIAPI *Open)
-  (EFI_FILE_PROTOCOL *This, EFI_FILE_PROTOCOL **NewHandle, const CHAR16 *FileName,
-   UINT64 OpenMode, UINT64 Attributes);
+  (EFI_FILE_PROTOCOL *This, EFI_FILE_PROTOCOL **NewHandle, const CHAR16 *FileName, UINT64 OpenMode,
+   UINT64 Attributes);
   EFI_STATUS(EFIAPI *Close)(EFI_FILE_PROTOCOL *This);
   EFI_STATUS(EFIAPI *Delete)(EFI_FILE_PROTOCOL *This);
   EFI_STATUS(EFIAPI *Read)(EFI_FILE_PROTOCOL *This, UINTN *BufferSize, void *Buffer);
@@ -579,11 +582,12 @@ struct EFI_SHELL_PARAMETERS_PROTOCOL {
 // ---------------------------------------------------------------------------
 struct EFI_UNICODE_COLLATION_PROTOCOL {
   INTN(EFIAPI *StriColl)(EFI_UNICODE_COLLATION_PROTOCOL *This, CHAR16 *Str1, CHAR16 *Str2);
-  BOOLEAN(EFIAPI *MetaiMatch)(EFI_UNICODE_COLLATION_PROTOCOL *This, CHAR16 *String, CHAR16 *Pattern);
+  BOOLEAN(EFIAPI *MetaiMatch)
+  (EFI_UNICODE_COLLATION_PROTOCOL *This, CHAR16 *String, CHAR16 *Pattern);
   void(EFIAPI *StrLwr)(EFI_UNICODE_COLLATION_PROTOCOL *This, CHAR16 *Str);
   void(EFIAPI *StrUpr)(EFI_UNICODE_COLLATION_PROTOCOL *This, CHAR16 *Str);
-  void(EFIAPI *FatToStr)
-  (EFI_UNICODE_COLLATION_PROTOCOL *This, UINTN FatSize, CHAR8 *Fat, CHAR16 *String);
+  void(EFIAPI *FatToStr)(EFI_UNICODE_COLLATION_PROTOCOL *This, UINTN FatSize, CHAR8 *Fat,
+                         CHAR16 *String);
   BOOLEAN(EFIAPI *StrToFat)
   (EFI_UNICODE_COLLATION_PROTOCOL *This, CHAR16 *String, UINTN FatSize, CHAR8 *Fat);
   CHAR8 *SupportedLanguages;
