@@ -7,7 +7,9 @@
 #
 # The share "fwe2e" of scripts/samba-test-server.sh (loopback, port 445)
 # holds a catalog, its signature, an 8 MiB file to import and an empty
-# export directory. QEMU's user-mode network shows this machine's loopback to
+# export directory. The server requires signing ("server signing =
+# mandatory"): every run signs its requests and checks the answers'
+# signatures with the image's own SHA-256. QEMU's user-mode network shows this machine's loopback to
 # the guest as 10.0.2.2, the only server address the guest is given, so no
 # packet leaves the machine. A second FAT disk, built with mtools and found by
 # startup.nsh through its marker file, is mapped as ramfs: and holds the log
@@ -47,6 +49,7 @@ FIRST_LIMIT=${FW_E2E_LIMIT:-150}
 export SMB_USER=cifstest
 export SMB_PASS=Cifs-Test-Pw1
 export SMB_SHARE=fwe2e
+export SMB_SIGNING=mandatory
 export SMB_DIR=${SMB_STATE_DIR:-/tmp/cifsdrv-samba}/share-fwe2e
 SAMBA="$REPO/scripts/samba-test-server.sh"
 SERVER=10.0.2.2

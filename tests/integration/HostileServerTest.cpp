@@ -11,6 +11,7 @@
 #include <dirent.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <fstream>
 #include <random>
 #include <sstream>
@@ -78,6 +79,13 @@ void OverrunAvPair(Bytes &A, const Bytes &) {
   Put(A, Info + 2, 0xFFF0, 2);
 }
 
+// A signed READ answer without its signature: the flag cleared, the
+// signature zeroed.
+void Unsign(Bytes &A) {
+  A[4 + 16] &= ~0x08;
+  std::fill(A.begin() + 4 + 48, A.begin() + 4 + 64, 0);
+}
+
 struct Case {
   const char *Name;
   char Action; // I import, G catalog, e export VML, m mount only
@@ -85,6 +93,7 @@ struct Case {
   int Status; // the VerifyStatus the run records
   bool Whole; // the file arrived whole (else: none left behind in ramfs:)
   const char *Proto;
+  const char *Signing = ""; // "mandatory": the server requires signing
 };
 
 const Case kCases[] = {
@@ -196,6 +205,16 @@ const Case kCases[] = {
      true,
      "SMB2_10"},
     {"dialect 0x0202", 'G', {}, 0, true, "SMB2_02"},
+    // A server that requires signing.
+    {"signed", 'e', {}, 0, true, "SMB2_02", "mandatory"},
+    {"signed answer with a byte changed",
+     'I',
+     {ReadData(2, [](Bytes &A) { A[100] ^= 1; })},
+     7,
+     false,
+     "SMB2_10",
+     "mandatory"},
+    {"unsigned answer", 'I', {ReadData(2, Unsign)}, 7, false, "SMB2_10", "mandatory"},
     {"maximum sizes of 16384",
      'e',
      {Bend(kNegotiate, 1,
@@ -264,7 +283,7 @@ TEST(HostileServerTest, TheOutcomeTellsTheTruth) {
   const std::string Work = "/tmp/cifsdrv-hostile";
   for (const Case &C : kCases) {
     SCOPED_TRACE(C.Name);
-    ASSERT_TRUE(SambaServer::Start(C.Proto));
+    ASSERT_TRUE(SambaServer::Start(C.Proto, C.Signing));
     const std::string Share = SambaServer::ShareDir(C.Proto);
     SambaServer::RunShell("rm -rf " + Work + " " + Share + "/exports && mkdir -p " + Work +
                           "/ramfs " + Share + "/exports && chmod 0777 " + Share + "/exports");
@@ -288,6 +307,10 @@ TEST(HostileServerTest, TheOutcomeTellsTheTruth) {
     EXPECT_EQ(Out.find("AddressSanitizer"), std::string::npos) << Out;
     EXPECT_EQ(Out.find("left behind"), std::string::npos) << Out;
     EXPECT_EQ(VerifyStatus(Work + "/vars.txt"), C.Status) << Out;
+    if (*C.Signing != 0 && !C.Faults.empty()) { // refused with a line naming the command
+      size_t Line = Out.rfind('\n', Out.find("signature is missing or wrong!, Status = 26"));
+      EXPECT_EQ(Out.compare(Line + 1, 26, "Function: SMB2ReadResponse"), 0) << Out;
+    }
     if (!C.Faults.empty()) {
       EXPECT_GT(R.Applied(), 0);
     }

@@ -55,11 +55,14 @@ inline std::string ShareDir(const std::string &MaxProto) {
   return kStateDir + "/share-" + Lower;
 }
 
-inline std::string Script(const std::string &Action, const std::string &MaxProto = "SMB2_10") {
-  return "SMB_STATE_DIR=" + kStateDir + " SMB_MIN_PROTO=SMB2_02 SMB_MAX_PROTO=" + MaxProto +
-         " SMB_USER=" + kUser + " SMB_PASS=" + kPassword + " SMB_SHARE=" + kShare +
-         " SMB_DIR=" + ShareDir(MaxProto) + " bash " + RepoRoot() +
-         "/scripts/samba-test-server.sh " + Action;
+// Signing: "mandatory" for a server that requires signed requests, empty
+// for Samba's default.
+inline std::string Script(const std::string &Action, const std::string &MaxProto = "SMB2_10",
+                          const std::string &Signing = "") {
+  return "SMB_STATE_DIR=" + kStateDir + " SMB_SIGNING=" + Signing +
+         " SMB_MIN_PROTO=SMB2_02 SMB_MAX_PROTO=" + MaxProto + " SMB_USER=" + kUser +
+         " SMB_PASS=" + kPassword + " SMB_SHARE=" + kShare + " SMB_DIR=" + ShareDir(MaxProto) +
+         " bash " + RepoRoot() + "/scripts/samba-test-server.sh " + Action;
 }
 
 // Test programs that share the one server on port 445 take turns: the
@@ -76,10 +79,11 @@ inline void TakeTurn() {
 }
 
 // Starts the server, or keeps it when it already runs with these settings.
-inline ::testing::AssertionResult Start(const std::string &MaxProto) {
+inline ::testing::AssertionResult Start(const std::string &MaxProto,
+                                        const std::string &Signing = "") {
   TakeTurn();
   std::string Out;
-  if (RunShell(Script("start", MaxProto), &Out) != 0) {
+  if (RunShell(Script("start", MaxProto, Signing), &Out) != 0) {
     return ::testing::AssertionFailure() << "samba-test-server.sh start failed: " << Out;
   }
   return ::testing::AssertionSuccess();
