@@ -124,7 +124,33 @@ FW_QEMU_ARGS=(
   -netdev "user,id=n0" -device "virtio-net-pci,netdev=n0,romfile="
   -device virtio-rng-pci
 )
-fw_stamp_markers "$WORK/serial.log" "$WORK/stamps.txt"
+# stamp_markers LOG OUT: in the background, follows the serial log LOG
+# (which must not exist yet: fw_boot creates it) and writes each "@@" line it
+# sees to OUT, prefixed with this machine's time in seconds. The follower is
+# stopped with the boot's other helpers.
+stamp_markers() {
+  perl -MTime::HiRes=time,sleep -e '
+    my ($log, $out) = @ARGV;
+    open(my $o, ">", $out) or die "$out: $!";
+    $o->autoflush(1);
+    my $in;
+    sleep 0.05 until open($in, "<", $log);
+    my $pending = "";
+    while (1) {
+      my $n = sysread($in, my $chunk, 65536);
+      if (!$n) { sleep 0.05; next; }
+      $pending .= $chunk;
+      while ($pending =~ s/^([^\n]*)\n//) {
+        my $line = $1;
+        $line =~ s/\e\[[0-9;?=]*[A-Za-z]//g;
+        $line =~ s/[\r\s]+$//;
+        printf $o "%.2f %s\n", time, $line if $line =~ /^@@/;
+      }
+    }
+  ' "$1" "$2" &
+  FW_CLEANUP_PIDS+=("$!")
+}
+stamp_markers "$WORK/serial.log" "$WORK/stamps.txt"
 fw_boot "$WORK" "$LIMIT" || true
 for _ in $(seq 1 40); do
   grep -q "@@DONE" "$WORK/stamps.txt" 2>/dev/null && break

@@ -133,7 +133,15 @@ const Case kCases[] = {
     // Malformed READ and WRITE answers.
     Fails("DataLength past the frame", 'I',
           {ReadData(2, [](Bytes &A) { Put(A, 72, GetLe32(A, 72) + 4096, 4); })}),
+    Fails("DataLength past the request", 'I',
+          {ReadData(2,
+                    [](Bytes &A) {
+                      Put(A, 72, GetLe32(A, 72) + 100, 4);
+                      A.resize(A.size() + 100);
+                    })}),
+    Fails("READ body cut short", 'I', {ReadData(2, [](Bytes &A) { A.resize(76); })}),
     Fails("DataOffset in the header", 'I', {ReadData(2, [](Bytes &A) { A[70] = 0x40; })}),
+    Fails("DataOffset past the frame", 'I', {ReadData(2, [](Bytes &A) { A[70] = 0xF0; })}),
     Fails("no data before the end", 'I', {ReadData(2, [](Bytes &A) { KeepData(A, 0); })}),
     Fails("WRITE Count 0", 'e', {WriteCount(1, [](uint32_t) { return 0u; })}),
     Fails("WRITE Count past what was sent", 'e',
