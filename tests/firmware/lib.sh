@@ -22,6 +22,27 @@ fw_require_tools() {
   [ -f "$OVMF_VARS" ] || fw_die "no OVMF variable store template at $OVMF_VARS"
 }
 
+# fw_setup NAME IMAGE BUILD_DIR: $EFI is BUILD_DIR/IMAGE (which must exist),
+# the tools are there, and $WORK is a fresh work directory.
+fw_setup() {
+  EFI="$3/$2"
+  [ -f "$EFI" ] || fw_die "no image at $EFI (build it first: ninja -C $3)"
+  fw_require_tools
+  fw_start_work "$1"
+}
+
+# fw_finish NAME LOG [LINES]: the verdict; after a failure the work directory
+# is kept and the last LINES of LOG are shown.
+fw_finish() {
+  if [ "$FW_FAILURES" -ne 0 ]; then
+    KEEP_WORK=1
+    echo "$1 test: $FW_FAILURES check(s) FAILED; console log kept at $2" >&2
+    [ -z "${3:-}" ] || tail -n "$3" "$2" | sed 's/^/    | /' >&2
+    exit 1
+  fi
+  echo "$1 test: all checks passed"
+}
+
 # Writes standard input to $1 with CR LF line ends, as the shell expects of
 # a script.
 fw_write_startup() {

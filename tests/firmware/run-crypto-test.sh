@@ -15,11 +15,8 @@ HERE=$(cd "$(dirname "$0")" && pwd)
 # shellcheck source=tests/firmware/lib.sh
 source "$HERE/lib.sh"
 
-EFI="$BUILD_DIR/CryptoCheck.efi"
-[ -f "$EFI" ] || fw_die "no image at $EFI (build it first: ninja -C $BUILD_DIR)"
-fw_require_tools
+fw_setup crypto CryptoCheck.efi "$BUILD_DIR"
 
-fw_start_work crypto
 
 # "connect -r" binds the RNG device's driver; only the boot disk is connected
 # when the shell starts.
@@ -62,9 +59,4 @@ crypto_run rng-device rng-protocol -net none -device virtio-rng-pci
 crypto_run rdrand rdrand -net none -cpu max
 crypto_run no-source none -net none
 
-if [ "$FW_FAILURES" -ne 0 ]; then
-  KEEP_WORK=1
-  echo "crypto test: $FW_FAILURES check(s) FAILED; console logs kept in $WORK" >&2
-  exit 1
-fi
-echo "crypto test: all checks passed"
+fw_finish crypto "$WORK"
