@@ -54,7 +54,7 @@ map -r
 ifconfig -s eth0 dhcp
 ifconfig6 -s eth0 auto
 fs0:
-fs0:\\NetCheck.efi 10.0.2.2 ${PORT[echo]} ${PORT[closed]} ${PORT[reset]} ${PORT[silent]} ${PORT[finish]} ${PORT[bulk]} $IPV6_ARGS
+fs0:\\NetCheck.efi 10.0.2.2 ${PORT[echo]} ${PORT[closed]} ${PORT[reset]} ${PORT[silent]} ${PORT[finish]} $IPV6_ARGS
 echo "LASTERROR=%lasterror%"
 echo "@@DONE"
 reset -s
