@@ -176,16 +176,6 @@ fw_fail() {
   FW_FAILURES=$((FW_FAILURES + 1))
 }
 
-# fw_check_contains FILE TEXT DESCRIPTION
-fw_check_contains() {
-  if grep -qF -- "$2" "$1"; then fw_pass "$3"; else fw_fail "$3 (no \"$2\")"; fi
-}
-
-# fw_check_absent FILE TEXT DESCRIPTION
-fw_check_absent() {
-  if grep -qF -- "$2" "$1"; then fw_fail "$3 (found \"$2\")"; else fw_pass "$3"; fi
-}
-
 # fw_check_text TEXT NEEDLE DESCRIPTION
 fw_check_text() {
   if grep -qF -- "$2" <<<"$1"; then fw_pass "$3"; else fw_fail "$3 (no \"$2\")"; fi
@@ -195,6 +185,11 @@ fw_check_text() {
 fw_check_absent_text() {
   if grep -qF -- "$2" <<<"$1"; then fw_fail "$3 (found \"$2\")"; else fw_pass "$3"; fi
 }
+
+# fw_check_contains FILE NEEDLE DESCRIPTION, fw_check_absent FILE NEEDLE
+# DESCRIPTION: the same on a file.
+fw_check_contains() { fw_check_text "$(<"$1")" "$2" "$3"; }
+fw_check_absent() { fw_check_absent_text "$(<"$1")" "$2" "$3"; }
 
 # fw_check_nonzero_lasterror TEXT DESCRIPTION
 fw_check_nonzero_lasterror() {
