@@ -1,6 +1,6 @@
 // What only a real server can show, against Samba on loopback
 // (scripts/samba-test-server.sh): the connect on both dialects over IPv4 and
-// IPv6, and the credential cases. (The wire as tshark reads it:
+// IPv6, and the refused credentials and shares. (The wire as tshark reads it:
 // tests/e2e/run-signing.sh; whole runs through the volume: the e2e scripts.)
 #include "SambaServer.h"
 #include "Smb2TestEnv.h"
@@ -52,21 +52,6 @@ INSTANTIATE_TEST_SUITE_P(Routes, SambaConnectTest,
 // ---------------------------------------------------------------------------
 // Credentials
 // ---------------------------------------------------------------------------
-TEST_F(SambaTest, DomainChoices) {
-  ASSERT_TRUE(SambaServer::Start("SMB2_10"));
-  struct Case {
-    const char *Domain;
-    const char *Used; // the server's NetBIOS domain from its challenge without one
-  } Cases[] = {{"CIFSTEST", "CIFSTEST"}, {"0", "CIFSTESTSRV"}, {nullptr, "CIFSTESTSRV"}};
-  for (const Case &C : Cases) {
-    Use("127.0.0.1", kShare, C.Domain);
-    std::string Out;
-    ASSERT_EQ(Connect(&Out), EFI_SUCCESS) << Out;
-    EXPECT_STREQ(TransactDetails.ShareDetails.DomainName, C.Used);
-    ASSERT_EQ(Disconnect(&Out), EFI_SUCCESS) << Out;
-  }
-}
-
 TEST_F(SambaTest, RefusedCredentialsAndShares) {
   ASSERT_TRUE(SambaServer::Start("SMB2_10"));
   struct Case {
