@@ -1,25 +1,10 @@
-# Helpers for the end-to-end scripts: a scratch directory with its own ramfs:
-# and variable store, running the hosted program, checks and the summary.
-#
-#   source lib.sh; e2e_init PATH_TO_CIFSDRV
-#   e2e_run ARGS...            -> $E2E_OUT (console text), $E2E_RC (exit code)
-#   e2e_check DESCRIPTION CMD... (passes when CMD succeeds)
-#   e2e_finish                 -> prints "N passed, M failed", exits non-zero on failure
-#
-# The Samba share behind the scripts, and the checks they share:
-#
-#   e2e_share_start              starts Samba on loopback (stopped at exit)
-#   e2e_fresh                    empty share, ramfs: and variable store
-#   e2e_share_put PATH [TEXT]    a file on the share (directories created)
-#   e2e_ramfs_put PATH [TEXT]    a file in ramfs:
-#   e2e_cifsdrv ACTION [ARGS..]  cifsdrv ACTION SHARE 127.0.0.1 USER PASSWORD ARGS
-#   e2e_trade TRADE SOURCE ...   cifsdrv e SHARE 127.0.0.1 TRADE SOURCE USER PASSWORD ...
-#   e2e_check_run NAME           the run left nothing behind and tripped no sanitizer
-#   e2e_verify_status NAME HEX   the outcome record's VerifyStatus byte
-#   e2e_seed_text_fields [PATH]  "PUPROVISIONING_ENV_VAR" with a catalog path
-#   e2e_text_field OFFSET        a text field of that record
-#   e2e_catalog_kind             "CATALOGFILE_ENV_VAR" as a number
-#
+# shellcheck shell=bash disable=SC2034 # E2E_RC and the GUIDs are the scripts'
+# Helpers for the end-to-end scripts (source lib.sh; e2e_init PATH_TO_CIFSDRV):
+# a scratch directory with its own ramfs: and variable store, the Samba share
+# (e2e_share_start, e2e_fresh, e2e_share_put, e2e_ramfs_put), runs of the
+# hosted program (e2e_cifsdrv, e2e_trade, e2e_run: $E2E_OUT and $E2E_RC),
+# checks (e2e_check DESCRIPTION CMD..., e2e_check_run, e2e_verify_status), the
+# provisioning variables, and the summary (e2e_finish: "N passed, M failed").
 # With CIFSDRV_CONSOLE_LOG set, every run's arguments and console text are
 # appended to that file (for comparing consoles across changes).
 
@@ -178,11 +163,6 @@ e2e_seed_text_fields() {
   echo "{$PU_GUID} PUPROVISIONING_ENV_VAR 3 $data" >>"$CIFSDRV_VARSTORE"
 }
 
-# Runs at the most verbose driver level.
-e2e_seed_verbose() {
-  echo "{$DEBUG_GUID} QVUIkestDebugLevel 3 35" >>"$CIFSDRV_VARSTORE"
-}
-
 e2e_text_field() {
   local value hex out="" i pair
   value=$(e2e_var "$PU_GUID" PUPROVISIONING_ENV_VAR)
@@ -191,7 +171,7 @@ e2e_text_field() {
   for ((i = 0; i < ${#hex}; i += 2)); do
     pair=${hex:i:2}
     [[ "$pair" == "00" ]] && break
-    out+=$(printf "\\x$pair")
+    out+=$(printf '%b' "\\x$pair")
   done
   printf '%s' "$out"
 }

@@ -2,8 +2,8 @@
 // OVMF by run-crypto-test.sh. It links the platform code exactly as
 // CIFSDrv.efi does and checks every primitive against published vectors:
 // MD4 (RFC 1320), MD5 (RFC 1321), HMAC-MD5 (RFC 2202), HMAC-SHA256
-// (RFC 4231) and RC4, each also fed in uneven pieces and at length, since the
-// digest code has been seen to go wrong only under firmware interrupts. Then
+// (RFC 4231) and RC4, fed whole and in uneven pieces. (HMAC-SHA256 at length,
+// under the firmware's interrupts: the e2e test's signed 8 MiB import.) Then
 // it reports which random source answered ("@@RANDOM <source>"); the script
 // knows which one QEMU offers.
 #include "FirmwareTestConsole.h"
@@ -19,31 +19,17 @@ struct DigestVector {
   const char *Md5;
 };
 
-// The test suites of RFC 1320 and RFC 1321 (same messages).
+// From the test suites of RFC 1320 and RFC 1321 (same messages): one block,
+// and two.
 constexpr DigestVector kDigestVectors[] = {
-    {"", "31d6cfe0d16ae931b73c59d7e0c089c0", "d41d8cd98f00b204e9800998ecf8427e"},
-    {"a", "bde52cb31de33e46245e05fbdbd6fb24", "0cc175b9c0f1b6a831c399e269772661"},
     {"abc", "a448017aaf21d8525fc10ae87aa6729d", "900150983cd24fb0d6963f7d28e17f72"},
-    {"message digest", "d9130a8164549fe818874806e1c7014b", "f96b697d7cb7938d525a2f31aaf161d0"},
-    {"abcdefghijklmnopqrstuvwxyz", "d79e1c308aa5bbcdeea8ed63df412da9",
-     "c3fcd3d76192e4007dfb496cca67e13b"},
-    {"ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789",
-     "043f8582f241db351ce627e153e7f0e4", "d174ab98d277d9f5a5611c2c9f419d9f"},
     {"1234567890123456789012345678901234567890123456789012345678901234567890123456789"
      "0",
      "e33b4ddc9c38f2199c3e7b164fcc0536", "57edf4a22be3c955ac49da2e2107b67a"},
 };
 
-// One million 'a', the long message of the classic digest test sets.
-constexpr UINT64 kMillion = 1000000;
-constexpr const char *kMillionAMd4 = "bbce80cc6bb65e5c6745e30d4eeca9a4";
-constexpr const char *kMillionAMd5 = "7707d6ae4e027c70eea2a935c2296f21";
-// HMAC-SHA256 of the same message under the key "Jefe".
-constexpr const char *kMillionAHmacSha256 =
-    "abce68067d665c96b6f4491fdc3de999dc09731b2d50a1f5e758d9ed583319d6";
-
 struct HmacVector {
-  UINT8 KeyByte; // the key is KeyLength copies of KeyByte, or 1..KeyLength when 0
+  UINT8 KeyByte; // the key is KeyLength copies of KeyByte
   UINT8 KeyLength;
   const char *KeyText; // instead of the bytes, when set
   UINT8 DataByte;      // the data is DataLength copies of DataByte
@@ -54,17 +40,12 @@ struct HmacVector {
 constexpr UINTN kMaxHmacKey = 131;
 constexpr UINTN kMaxHmacData = 50;
 
-// RFC 2202, test cases 1, 2, 3, 6 and 7 for HMAC-MD5 (short, long-data and
-// longer-than-a-block keys).
+// RFC 2202, test cases 3 and 6 for HMAC-MD5 (a short key with data of
+// bytes, a key longer than a block).
 constexpr HmacVector kHmacMd5Vectors[] = {
-    {0x0b, 16, nullptr, 0, 0, "Hi There", "9294727a3638bb1c13f48ef8158bfc9d"},
-    {0, 0, "Jefe", 0, 0, "what do ya want for nothing?", "750c783e6ab0b503eaa86e310a5db738"},
     {0xaa, 16, nullptr, 0xdd, 50, nullptr, "56be34521d144c88dbb8c733f0e8b3f6"},
     {0xaa, 80, nullptr, 0, 0, "Test Using Larger Than Block-Size Key - Hash Key First",
      "6b1ab7fe4bd7bf8f0b62e6ce61b9d0cd"},
-    {0xaa, 80, nullptr, 0, 0,
-     "Test Using Larger Than Block-Size Key and Larger Than One Block-Size Data",
-     "6f630fad67cda0ee1fb1f562db3aa53e"},
 };
 
 // RFC 4231, test cases 1, 2, 6 and 7 for HMAC-SHA-256.
@@ -88,8 +69,6 @@ struct Rc4Vector {
 };
 
 constexpr Rc4Vector kRc4Vectors[] = {
-    {"Key", "Plaintext", "bbf316e8d940af0ad3"},
-    {"Wiki", "pedia", "1021bf0420"},
     {"Secret", "Attack at dawn", "45a01f645fc35b383552544b9bf5"},
 };
 // RFC 6229: the first 16 key-stream bytes for the 40-bit key 0102030405.
@@ -140,45 +119,6 @@ void CheckDigestVectors() {
   }
 }
 
-// A million 'a' in pieces whose sizes keep changing, so that every offset
-// within a block is a piece boundary at some point.
-void CheckMillion() {
-  constexpr UINT64 kChunk = 1031;
-  UINT8 *A = static_cast<UINT8 *>(AllocatePool(kChunk));
-  if (!FwTestCheck(A != nullptr, "buffer for the million-byte message")) {
-    return;
-  }
-  SetMem(A, kChunk, 'a');
-  NwMd4Context Md4;
-  NwHmacSha256Context Hmac;
-  bool Ok = NwMd4Init(&Md4) && NwHmacSha256Init(&Hmac, Bytes("Jefe"), 4);
-  UINT64 Done = 0;
-  for (UINT64 Piece = 1; Ok && Done < kMillion; Piece = (Piece * 5 + 13) % kChunk + 1) {
-    UINT64 Take = kMillion - Done < Piece ? kMillion - Done : Piece;
-    Ok = NwMd4Update(&Md4, A, Take) && NwHmacSha256Update(&Hmac, A, Take);
-    Done += Take;
-  }
-  UINT8 Digest[16] = {};
-  UINT8 Mac[NW_SHA256_DIGEST_SIZE] = {};
-  Ok = Ok && NwMd4Final(&Md4, Digest) && NwHmacSha256Final(&Hmac, Mac);
-  FwTestCheck(Ok && HexIs(Digest, 16, kMillionAMd4), "MD4 of a million 'a' = %a",
-              FwTestHex(Digest, 16));
-  FwTestCheck(Ok && HexIs(Mac, sizeof(Mac), kMillionAHmacSha256),
-              "HMAC-SHA256 of a million 'a' = %a", FwTestHex(Mac, sizeof(Mac)));
-  // MD5 over the same message in one piece.
-  UINT8 *Big = static_cast<UINT8 *>(AllocatePool(kMillion));
-  if (Big != nullptr) {
-    SetMem(Big, kMillion, 'a');
-    Ok = UefiMd5Digest(Big, kMillion, Digest);
-    FwTestCheck(Ok && HexIs(Digest, 16, kMillionAMd5), "MD5 of a million 'a' = %a",
-                FwTestHex(Digest, 16));
-    FreePool(Big);
-  } else {
-    FwTestCheck(false, "buffer for MD5 of a million 'a'");
-  }
-  FreePool(A);
-}
-
 // The MAC of Data under Key through one of the facade's HMACs, fed as the
 // first Split bytes and then the rest.
 template <typename Context, bool (*Init)(Context *, const uint8_t *, uint64_t),
@@ -204,9 +144,7 @@ void CheckHmacVectors(const char *Name, const HmacVector (&Vectors)[Count], Hmac
       KeyBytes = Bytes(V.KeyText);
       KeyLength = AsciiStrLen(V.KeyText);
     } else {
-      for (UINTN I = 0; I < KeyLength; I++) {
-        Key[I] = V.KeyByte != 0 ? V.KeyByte : static_cast<UINT8>(I + 1);
-      }
+      SetMem(Key, KeyLength, V.KeyByte);
     }
     const UINT8 *DataBytes = Data;
     UINTN DataLength = V.DataLength;
@@ -294,7 +232,6 @@ extern "C" EFI_STATUS EFIAPI EfiMain(EFI_HANDLE ImageHandle, EFI_SYSTEM_TABLE *S
   FwTestStart(ImageHandle, SystemTable);
   FwTestPrint("@@BEGIN crypto-check\n");
   CheckDigestVectors();
-  CheckMillion();
   CheckHmacs();
   CheckRc4();
   CheckRandom();

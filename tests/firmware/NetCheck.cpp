@@ -3,14 +3,12 @@
 // machine's loopback, which QEMU's user networking shows the guest as
 // 10.0.2.2.
 //
-//   NetCheck.efi SERVER ECHO CLOSED RESET SILENT FINISH BULK [SERVER6 ECHO6]
+//   NetCheck.efi SERVER ECHO CLOSED RESET SILENT FINISH [SERVER6 ECHO6]
 //
 // SERVER is the peer's IPv4 address, the rest are its ports: ECHO returns
 // every byte, CLOSED has no listener, RESET accepts and resets at once,
-// SILENT accepts and never answers, FINISH sends kFinishBytes and closes,
-// BULK sends kBulkBytes and closes (read as the SMB2 client reads, with the
-// time it took printed). SERVER6 and ECHO6, when given, repeat the echo
-// check over IPv6.
+// SILENT accepts and never answers, FINISH sends kFinishBytes and closes.
+// SERVER6 and ECHO6, when given, repeat the echo check over IPv6.
 #include "FirmwareTestConsole.h"
 #include "NwPlatform.h"
 
@@ -18,8 +16,6 @@ namespace {
 
 constexpr UINT64 kEchoBytes = 150000; // more than two of the connection's 64 KiB buffers
 constexpr UINT64 kFinishBytes = 3000;
-constexpr UINT64 kBulkBytes = 8 * 1024 * 1024;
-constexpr UINT64 kBulkReadSize = 64512; // the SMB2 client's largest read
 constexpr UINT64 kSocketWaitMs = 10000;
 // The real-time clock may count whole seconds only.
 constexpr UINT64 kClockSlackMs = 2000;
@@ -229,24 +225,22 @@ extern "C" EFI_STATUS EFIAPI EfiMain(EFI_HANDLE ImageHandle, EFI_SYSTEM_TABLE *S
   if (Server != nullptr) {
     AsciiStrCpyS(Address, sizeof(Address), Server);
   }
-  if (FwTestArgument(7) != nullptr) {
-    AsciiStrCpyS(Address6, sizeof(Address6), FwTestArgument(7));
+  if (FwTestArgument(6) != nullptr) {
+    AsciiStrCpyS(Address6, sizeof(Address6), FwTestArgument(6));
   }
   const Peer Echo = {Address, NW_AF_INET, PortArgument(1)};
   const Peer Closed = {Address, NW_AF_INET, PortArgument(2)};
   const Peer Reset = {Address, NW_AF_INET, PortArgument(3)};
   const Peer Silent = {Address, NW_AF_INET, PortArgument(4)};
   const Peer Finish = {Address, NW_AF_INET, PortArgument(5)};
-  const Peer Bulk = {Address, NW_AF_INET, PortArgument(6)};
-  const Peer Echo6 = {Address6, NW_AF_INET6, PortArgument(8)};
-  if (FwTestCheck(Server != nullptr && Bulk.Port != 0, "arguments: server and six ports")) {
+  const Peer Echo6 = {Address6, NW_AF_INET6, PortArgument(7)};
+  if (FwTestCheck(Server != nullptr && Finish.Port != 0, "arguments: server and five ports")) {
     CheckEcho(Echo, "echo");
     CheckFinish(Finish, "finish", kFinishBytes, 1024);
     CheckClosedPort(Closed);
     CheckReset(Reset, false, "reset");
     CheckReset(Reset, true, "reset before the read");
     CheckSilent(Silent);
-    CheckFinish(Bulk, "bulk", kBulkBytes, kBulkReadSize);
     if (Echo6.Port != 0) {
       CheckEcho(Echo6, "echo over IPv6");
     }

@@ -22,6 +22,27 @@ fw_require_tools() {
   [ -f "$OVMF_VARS" ] || fw_die "no OVMF variable store template at $OVMF_VARS"
 }
 
+# fw_setup NAME IMAGE BUILD_DIR: $EFI is BUILD_DIR/IMAGE (which must exist),
+# the tools are there, and $WORK is a fresh work directory.
+fw_setup() {
+  EFI="$3/$2"
+  [ -f "$EFI" ] || fw_die "no image at $EFI (build it first: ninja -C $3)"
+  fw_require_tools
+  fw_start_work "$1"
+}
+
+# fw_finish NAME LOG [LINES]: the verdict; after a failure the work directory
+# is kept and the last LINES of LOG are shown.
+fw_finish() {
+  if [ "$FW_FAILURES" -ne 0 ]; then
+    KEEP_WORK=1
+    echo "$1 test: $FW_FAILURES check(s) FAILED; console log kept at $2" >&2
+    [ -z "${3:-}" ] || tail -n "$3" "$2" | sed 's/^/    | /' >&2
+    exit 1
+  fi
+  echo "$1 test: all checks passed"
+}
+
 # Writes standard input to $1 with CR LF line ends, as the shell expects of
 # a script.
 fw_write_startup() {
@@ -155,16 +176,6 @@ fw_fail() {
   FW_FAILURES=$((FW_FAILURES + 1))
 }
 
-# fw_check_contains FILE TEXT DESCRIPTION
-fw_check_contains() {
-  if grep -qF -- "$2" "$1"; then fw_pass "$3"; else fw_fail "$3 (no \"$2\")"; fi
-}
-
-# fw_check_absent FILE TEXT DESCRIPTION
-fw_check_absent() {
-  if grep -qF -- "$2" "$1"; then fw_fail "$3 (found \"$2\")"; else fw_pass "$3"; fi
-}
-
 # fw_check_text TEXT NEEDLE DESCRIPTION
 fw_check_text() {
   if grep -qF -- "$2" <<<"$1"; then fw_pass "$3"; else fw_fail "$3 (no \"$2\")"; fi
@@ -174,6 +185,11 @@ fw_check_text() {
 fw_check_absent_text() {
   if grep -qF -- "$2" <<<"$1"; then fw_fail "$3 (found \"$2\")"; else fw_pass "$3"; fi
 }
+
+# fw_check_contains FILE NEEDLE DESCRIPTION, fw_check_absent FILE NEEDLE
+# DESCRIPTION: the same on a file.
+fw_check_contains() { fw_check_text "$(<"$1")" "$2" "$3"; }
+fw_check_absent() { fw_check_absent_text "$(<"$1")" "$2" "$3"; }
 
 # fw_check_nonzero_lasterror TEXT DESCRIPTION
 fw_check_nonzero_lasterror() {

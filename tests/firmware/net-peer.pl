@@ -4,7 +4,7 @@
 #
 #   net-peer.pl PORT_FILE LIFETIME_SECONDS
 #
-# Writes "echo=N closed=N reset=N silent=N finish=N bulk=N echo6=N" to PORT_FILE
+# Writes "echo=N closed=N reset=N silent=N finish=N echo6=N" to PORT_FILE
 # once listening (echo6 is 0 when ::1 is unavailable), then serves until
 # LIFETIME_SECONDS have passed:
 #   echo    returns every byte it receives (buffered without limit, so a
@@ -15,7 +15,6 @@
 #           that QEMU completes for the guest, turning it into a refusal
 #   silent  accepts and never sends or closes
 #   finish  sends FINISH_BYTES of the test pattern and closes in order
-#   bulk    as finish, with BULK_BYTES (a throughput measure)
 #   echo6   as echo, on ::1
 use strict;
 use warnings;
@@ -26,7 +25,6 @@ use Errno qw(EAGAIN EWOULDBLOCK EINTR);
 use Time::HiRes qw(time);
 
 use constant FINISH_BYTES => 3000;
-use constant BULK_BYTES => 8 * 1024 * 1024;
 use constant RESET_DELAY => 0.2;
 
 my ($port_file, $lifetime) = @ARGV;
@@ -50,7 +48,7 @@ sub pattern {
 
 my %role_of;    # listener fileno -> role
 my %listener;   # role -> socket
-for my $role (qw(echo reset silent finish bulk)) {
+for my $role (qw(echo reset silent finish)) {
   my $socket = listener('127.0.0.1') or die "listen on 127.0.0.1: $!\n";
   $listener{$role} = $socket;
   $role_of{fileno $socket} = $role;
@@ -65,14 +63,12 @@ my $closed_port = $closed->sockport;
 close $closed;
 
 open my $out, '>', "$port_file.tmp" or die "$port_file: $!\n";
-printf $out "echo=%d closed=%d reset=%d silent=%d finish=%d bulk=%d echo6=%d\n",
+printf $out "echo=%d closed=%d reset=%d silent=%d finish=%d echo6=%d\n",
   $listener{echo}->sockport, $closed_port, $listener{reset}->sockport,
-  $listener{silent}->sockport, $listener{finish}->sockport, $listener{bulk}->sockport,
-  $v6 ? $v6->sockport : 0;
+  $listener{silent}->sockport, $listener{finish}->sockport, $v6 ? $v6->sockport : 0;
 close $out;
 rename "$port_file.tmp", $port_file or die "$port_file: $!\n";
 
-my $bulk = pattern(BULK_BYTES);
 my $readers = IO::Select->new(values %listener);
 my %pending;    # echo connection fileno -> bytes still to send back
 my %echo;       # fileno -> socket
@@ -121,10 +117,8 @@ while (time < $deadline) {
         push @resets, [$client, time + RESET_DELAY];
       } elsif ($role eq 'silent') {
         push @silent, $client;
-      } elsif ($role eq 'finish' || $role eq 'bulk') {
-        # The bulk sender blocks this loop while it writes; nothing else is
-        # under way at that point of the test.
-        my $data = $role eq 'bulk' ? $bulk : pattern(FINISH_BYTES);
+      } elsif ($role eq 'finish') {
+        my $data = pattern(FINISH_BYTES);
         while (length $data) {
           my $n = syswrite $client, $data;
           last unless defined $n;

@@ -19,11 +19,8 @@ HERE=$(cd "$(dirname "$0")" && pwd)
 # shellcheck source=tests/firmware/lib.sh
 source "$HERE/lib.sh"
 
-EFI="$BUILD_DIR/CIFSDrv.efi"
-[ -f "$EFI" ] || fw_die "no image at $EFI (build it first: ninja -C $BUILD_DIR)"
-fw_require_tools
+fw_setup boot CIFSDrv.efi "$BUILD_DIR"
 
-fw_start_work boot
 
 # The runs. Each run's console output is framed by markers so that the
 # checks below look only at their own run.
@@ -101,10 +98,4 @@ else
   fw_pass "outcome variable records the failed mount (VerifyStatus 0x$verify)"
 fi
 
-if [ "$FW_FAILURES" -ne 0 ]; then
-  KEEP_WORK=1
-  echo "boot test: $FW_FAILURES check(s) FAILED; console log kept at $LOG; its end:" >&2
-  tail -n 40 "$LOG" | sed 's/^/    | /' >&2
-  exit 1
-fi
-echo "boot test: all checks passed"
+fw_finish boot "$LOG" 40

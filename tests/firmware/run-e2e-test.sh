@@ -5,29 +5,20 @@
 #
 #   tests/firmware/run-e2e-test.sh BUILD_DIR   (the directory holding CIFSDrv.efi)
 #
-# The share "fwe2e" of scripts/samba-test-server.sh (loopback, port 445)
-# holds a catalog, its signature, an 8 MiB file to import and an empty
-# export directory. The server requires signing ("server signing =
-# mandatory"): every run signs its requests and checks the answers'
-# signatures with the image's own SHA-256. QEMU's user-mode network shows this machine's loopback to
-# the guest as 10.0.2.2, the only server address the guest is given, so no
-# packet leaves the machine. A second FAT disk, built with mtools and found by
-# startup.nsh through its marker file, is mapped as ramfs: and holds the log
-# to export.
+# The share "fwe2e" (loopback, port 445) holds a catalog, its signature, an
+# 8 MiB file to import and an empty export directory, and requires signing
+# ("server signing = mandatory"): every run signs with the image's own
+# SHA-256. QEMU's user-mode network shows this machine's loopback to the guest
+# as 10.0.2.2, its only server address. A second FAT disk, found by
+# startup.nsh through its marker file, is mapped as ramfs: and holds the log to
+# export. One boot runs "m", "G", "S", "I", "e ... Export VML", "E" and a
+# wrong password, each followed by its %lasterror% and the outcome variable;
+# then the RAM disk is read back with mtools and compared byte for byte with
+# the share, and the share is searched for the exported log.
 #
-# One boot: "m", "G", "S", "I", "e ... Export VML", "E" and a wrong
-# password, each followed by its %lasterror% and a dump of the outcome
-# variable. Afterwards the RAM disk is read back with mtools and compared
-# byte for byte with the share, and the share is searched for the exported
-# log. (A refused connection in the firmware: run-net-test.sh.)
-#
-# Settings (environment):
-#   FW_E2E_DEBUG_LEVEL  driver debug level stored before the runs (0 to 5)
-#   FW_E2E_LIMIT        time limit of the boot in seconds (150)
-#   FW_CONSOLE_DIR      a directory the console log is copied to
-#
-# Exit status 0 when every check passes; otherwise the failed checks and the
-# path of the kept console log are printed.
+# Settings: FW_E2E_DEBUG_LEVEL (driver debug level stored before the runs),
+# FW_E2E_LIMIT (time limit of the boot, 150 s), FW_CONSOLE_DIR (where the
+# console log is copied). Exit status 0 when every check passes.
 set -euo pipefail
 
 BUILD_DIR=${1:?usage: $0 BUILD_DIR}
@@ -36,9 +27,7 @@ REPO=$(cd "$HERE/../.." && pwd)
 # shellcheck source=tests/firmware/lib.sh
 source "$HERE/lib.sh"
 
-EFI="$BUILD_DIR/CIFSDrv.efi"
-[ -f "$EFI" ] || fw_die "no image at $EFI (build it first: ninja -C $BUILD_DIR)"
-fw_require_tools
+fw_setup fw-e2e CIFSDrv.efi "$BUILD_DIR"
 for tool in perl cmp gzip; do
   command -v "$tool" >/dev/null || fw_die "$tool not found (run scripts/install-deps.sh)"
 done
@@ -62,7 +51,6 @@ PU_GUID=4D4AC77B-DD0A-447E-8117-104901DA8679
 CATALOG_GUID=806E07A4-AE56-11E1-A464-FE1F6188709B
 DEBUG_GUID=47C7B224-C42A-11D2-8E57-00A0C969723B
 
-fw_start_work fw-e2e
 mkdir -p "$WORK/local" "$WORK/back"
 # At exit: QEMU's helpers and the work directory (lib.sh), then the share's
 # files and the server, as the other Samba tests leave it.
@@ -295,18 +283,9 @@ check_returned() {
   fw_check_absent_text "$1" "X64 Exception" "$2: no processor exception"
 }
 
-# check_verify TEXT NAME HEX: VerifyStatus, the first byte of the outcome
-# variable dumped after the step.
-check_verify() {
-  local value
-  value=$(fw_verify_status "$1")
-  if [ -z "$value" ]; then
-    fw_fail "$2: outcome variable not found after the run"
-  elif [ "$value" = "$3" ]; then
-    fw_pass "$2: VerifyStatus 0x$value"
-  else
-    fw_fail "$2: VerifyStatus 0x$value, want 0x$3"
-  fi
+# check_is WHAT VALUE WANT
+check_is() {
+  if [ "$2" = "$3" ]; then fw_pass "$1 $2"; else fw_fail "$1 ${2:-missing}, want $3"; fi
 }
 
 check_success() {
@@ -316,7 +295,7 @@ check_success() {
   fw_check_text "$text" "LASTERROR=0x0" "$1: image returned EFI_SUCCESS"
   fw_check_absent_text "$text" "Mount partition failed!" "$1: the share mounted"
   fw_check_absent_text "$text" "Drive name len" "$1: the mounted share got a shell name"
-  check_verify "$text" "$1" 00
+  check_is "$1: VerifyStatus" "$(fw_verify_status "$text")" 00
 }
 
 # check_failed_mount FILE NAME: the mount failed and the run still ended
@@ -365,19 +344,10 @@ check_success mount
 check_success catalog
 catalog=$(fw_section "$FIRST" catalog)
 check_same "catalog" catalog.xml.gz "$SMB_DIR/catalog/catalog.xml.gz"
-kind=$(fw_var_hex "$catalog" "$CATALOG_GUID" CATALOGFILE_ENV_VAR)
-if [ "$kind" = 02000000 ]; then
-  fw_pass "catalog: CATALOGFILE_ENV_VAR records kind 2 (catalog.xml.gz)"
-else
-  fw_fail "catalog: CATALOGFILE_ENV_VAR is ${kind:-missing}, want 02000000"
-fi
+check_is "catalog: CATALOGFILE_ENV_VAR (kind 2, catalog.xml.gz)" \
+  "$(fw_var_hex "$catalog" "$CATALOG_GUID" CATALOGFILE_ENV_VAR)" 02000000
 fields=$(fw_var_hex "$catalog" "$PU_GUID" PUPROVISIONING_ENV_VAR)
-remembered=$(fw_hex_text "${fields:768:256}")
-if [ "$remembered" = 'CIFS:\catalog' ]; then
-  fw_pass "catalog: the directory CIFS:\\catalog is remembered"
-else
-  fw_fail "catalog: remembered directory \"$remembered\", want \"CIFS:\\catalog\""
-fi
+check_is "catalog: the directory remembered" "$(fw_hex_text "${fields:768:256}")" 'CIFS:\catalog'
 
 check_success signature
 check_same "signature" catalog.xml.gz.sign "$SMB_DIR/catalog/catalog.xml.gz.sign"
@@ -409,9 +379,4 @@ check_failed_mount "$FIRST" bad-password
 
 echo "e2e test: CIFSDrv.efi is $(stat -c %s "$EFI") bytes"
 
-if [ "$FW_FAILURES" -ne 0 ]; then
-  KEEP_WORK=1
-  echo "e2e test: $FW_FAILURES check(s) FAILED; console log kept at $FIRST" >&2
-  exit 1
-fi
-echo "e2e test: all checks passed"
+fw_finish e2e "$FIRST"

@@ -8,12 +8,10 @@
 
 #include <gtest/gtest.h>
 
-#include <dirent.h>
 #include <unistd.h>
 
-#include <algorithm>
+#include <filesystem>
 #include <fstream>
-#include <random>
 #include <sstream>
 
 namespace {
@@ -30,24 +28,13 @@ void Put(Bytes &Frame, size_t At, uint64_t Value, int Width) {
   }
 }
 
-// Rewrites that bend one answer.
+// Rewrites that bend one answer, and the other faults.
 Fault Bend(uint16_t Command, int Occurrence,
            std::function<void(Bytes &Answer, const Bytes &Request)> Edit) {
-  Fault F;
-  F.What = Fault::Rewrite;
-  F.Command = Command;
-  F.Occurrence = Occurrence;
-  F.Edit = std::move(Edit);
-  return F;
+  return {Fault::Rewrite, Command, Occurrence, 0, std::move(Edit)};
 }
-
 Fault Hit(Fault::Kind What, uint16_t Command, int Occurrence, size_t Count = 0) {
-  Fault F;
-  F.What = What;
-  F.Command = Command;
-  F.Occurrence = Occurrence;
-  F.Count = Count;
-  return F;
+  return {What, Command, Occurrence, Count, nullptr};
 }
 
 // READ answers (framed): DataOffset at 70, DataLength at 72, data at 84.
@@ -176,18 +163,7 @@ const Case kCases[] = {
 
 std::string ReadFile(const std::string &Path) {
   std::ifstream In(Path, std::ios::binary);
-  std::stringstream Out;
-  Out << In.rdbuf();
-  return Out.str();
-}
-
-void WriteRandom(const std::string &Path, size_t Size, unsigned Seed) {
-  std::string Data(Size, '\0');
-  std::mt19937 Random(Seed);
-  for (char &C : Data) {
-    C = static_cast<char>(Random());
-  }
-  std::ofstream(Path, std::ios::binary) << Data;
+  return std::string(std::istreambuf_iterator<char>(In), {});
 }
 
 // The first byte of the outcome record in the variable store.
@@ -204,16 +180,12 @@ int VerifyStatus(const std::string &Store) {
 
 // The exported log on the share, empty when there is none.
 std::string ExportedLog(const std::string &Dir) {
-  std::string Found;
-  if (DIR *D = opendir(Dir.c_str())) {
-    while (dirent *E = readdir(D)) {
-      if (std::string(E->d_name).find("_VelmorLog_") != std::string::npos) {
-        Found = ReadFile(Dir + "/" + E->d_name);
-      }
+  for (const auto &Entry : std::filesystem::directory_iterator(Dir)) {
+    if (Entry.path().filename().string().find("_VelmorLog_") != std::string::npos) {
+      return ReadFile(Entry.path());
     }
-    closedir(D);
   }
-  return Found;
+  return "";
 }
 
 TEST(HostileServerTest, TheOutcomeTellsTheTruth) {
@@ -223,11 +195,10 @@ TEST(HostileServerTest, TheOutcomeTellsTheTruth) {
     ASSERT_TRUE(SambaServer::Start(C.Proto, C.Signing));
     const std::string Share = SambaServer::ShareDir(C.Proto);
     SambaServer::RunShell("rm -rf " + Work + " " + Share + "/exports && mkdir -p " + Work +
-                          "/ramfs " + Share + "/exports && chmod 0777 " + Share + "/exports");
-    WriteRandom(Share + "/big.bin", 1 << 20, 7);
-    WriteRandom(Share + "/catalog.xml.gz", 300000, 8);
-    WriteRandom(Work + "/ramfs/VelmorLog.xml", 200000, 9);
-    SambaServer::RunShell("chmod -R a+rwX " + Share);
+                          "/ramfs " + Share + "/exports && cd " + Share +
+                          " && head -c 1048576 /dev/urandom > big.bin && head -c 300000 "
+                          "/dev/urandom > catalog.xml.gz && head -c 200000 /dev/urandom > " +
+                          Work + "/ramfs/VelmorLog.xml && chmod -R a+rwX " + Share);
     Relay R(C.Faults);
     const std::string Login = SambaServer::kUser + " " + SambaServer::kPassword;
     const std::string Args = C.Action == 'e'

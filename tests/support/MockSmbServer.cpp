@@ -19,6 +19,8 @@ constexpr int kAcceptTimeoutMs = 10000;
 constexpr int kReadTimeoutMs = 10000;
 constexpr int kDrainIdleMs = 200;
 
+} // namespace
+
 bool WriteAll(int Fd, const uint8_t *Data, size_t Length) {
   while (Length > 0) {
     ssize_t Sent = send(Fd, Data, Length, MSG_NOSIGNAL);
@@ -43,7 +45,31 @@ bool ReadAll(int Fd, uint8_t *Data, size_t Length) {
   return true;
 }
 
-} // namespace
+bool ReadFrame(int Fd, Bytes &Out) {
+  Out.assign(4, 0);
+  if (!ReadAll(Fd, Out.data(), 4) || StreamLength(Out) > (1u << 24)) {
+    return false;
+  }
+  Out.resize(4 + StreamLength(Out));
+  return ReadAll(Fd, Out.data() + 4, Out.size() - 4);
+}
+
+int ListenOnLoopback(uint16_t *Port) {
+  int Fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_in In = {};
+  In.sin_family = AF_INET;
+  In.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  socklen_t Size = sizeof(In);
+  if (Fd < 0 || bind(Fd, reinterpret_cast<sockaddr *>(&In), Size) != 0 || listen(Fd, 1) != 0 ||
+      getsockname(Fd, reinterpret_cast<sockaddr *>(&In), &Size) != 0) {
+    if (Fd >= 0) {
+      close(Fd);
+    }
+    return -1;
+  }
+  *Port = ntohs(In.sin_port);
+  return Fd;
+}
 
 Bytes Le(uint64_t Value, size_t Width) {
   Bytes Out(Width);
@@ -210,23 +236,10 @@ Bytes ErrorResponse(uint16_t Command, uint32_t Status, uint64_t MessageId, uint6
 // Server
 // ---------------------------------------------------------------------------
 Server::Server() {
-  ListenFd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  ListenFd = ListenOnLoopback(&ListenPort);
   if (ListenFd < 0) {
-    Fail("socket failed");
-    return;
+    Fail("no loopback listener");
   }
-  int One = 1;
-  setsockopt(ListenFd, SOL_SOCKET, SO_REUSEADDR, &One, sizeof(One));
-  sockaddr_in In = {};
-  In.sin_family = AF_INET;
-  In.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t Size = sizeof(In);
-  if (bind(ListenFd, reinterpret_cast<sockaddr *>(&In), Size) != 0 || listen(ListenFd, 1) != 0) {
-    Fail("bind/listen failed");
-    return;
-  }
-  getsockname(ListenFd, reinterpret_cast<sockaddr *>(&In), &Size);
-  ListenPort = ntohs(In.sin_port);
 }
 
 Server::~Server() {
@@ -312,20 +325,6 @@ void Server::Fail(const std::string &Why) {
   }
 }
 
-bool Server::ReadRequest(int Fd, Bytes &Out) {
-  uint8_t Prefix[4];
-  if (!ReadAll(Fd, Prefix, sizeof(Prefix))) {
-    return false;
-  }
-  uint32_t Length = StreamLength(Bytes(Prefix, Prefix + 4));
-  if (Length > (1u << 24)) {
-    return false;
-  }
-  Out.assign(Prefix, Prefix + 4);
-  Out.resize(4 + Length);
-  return ReadAll(Fd, Out.data() + 4, Length);
-}
-
 void Server::Run() {
   pollfd Wait = {ListenFd, POLLIN, 0};
   if (poll(&Wait, 1, kAcceptTimeoutMs) != 1) {
@@ -345,7 +344,7 @@ void Server::Run() {
     switch (S.What) {
     case Step::Expect: {
       Bytes Request;
-      if (!ReadRequest(Fd, Request)) {
+      if (!ReadFrame(Fd, Request)) {
         Fail("step " + std::to_string(I) + ": expected a request, connection ended");
         close(Fd);
         Open = false;
@@ -400,7 +399,7 @@ void Server::Run() {
     // been quiet for a moment or closes.
     Bytes Request;
     pollfd Idle = {Fd, POLLIN, 0};
-    while (poll(&Idle, 1, kDrainIdleMs) == 1 && ReadRequest(Fd, Request)) {
+    while (poll(&Idle, 1, kDrainIdleMs) == 1 && ReadFrame(Fd, Request)) {
       std::lock_guard<std::mutex> Guard(Lock);
       Received.push_back(Request);
     }

@@ -86,6 +86,14 @@ Bytes ErrorResponse(uint16_t Command, uint32_t Status, uint64_t MessageId, uint6
 constexpr uint64_t kSessionId = 0x0000A1B2C3D40001ULL;
 constexpr uint32_t kTreeId = 0x00000005;
 
+// Sockets: whole writes and reads (false once the peer is gone), one framed
+// message of at most 16 MiB, and a listener on a free loopback port (-1 when
+// there is none).
+bool WriteAll(int Fd, const uint8_t *Data, size_t Length);
+bool ReadAll(int Fd, uint8_t *Data, size_t Length);
+bool ReadFrame(int Fd, Bytes &Out);
+int ListenOnLoopback(uint16_t *Port);
+
 // ---------------------------------------------------------------------------
 // The server
 // ---------------------------------------------------------------------------
@@ -137,7 +145,6 @@ private:
   };
   Server &Add(Step S);
   void Run();
-  bool ReadRequest(int Fd, Bytes &Out);
   void Fail(const std::string &Why);
 
   int ListenFd = -1;

@@ -23,39 +23,6 @@ int64_t NowNs() {
       .count();
 }
 
-bool ReadAll(int Fd, uint8_t *Data, size_t Length) {
-  while (Length > 0) {
-    ssize_t Got = read(Fd, Data, Length);
-    if (Got <= 0) {
-      return false;
-    }
-    Data += Got;
-    Length -= static_cast<size_t>(Got);
-  }
-  return true;
-}
-
-// One framed message: the prefix, then what it announces.
-bool ReadFrame(int Fd, Bytes &Out) {
-  Out.assign(4, 0);
-  if (!ReadAll(Fd, Out.data(), 4)) {
-    return false;
-  }
-  Out.resize(4 + StreamLength(Out));
-  return ReadAll(Fd, Out.data() + 4, Out.size() - 4);
-}
-
-void SendAll(int Fd, const uint8_t *Data, size_t Length) {
-  while (Length > 0) {
-    ssize_t Sent = send(Fd, Data, Length, MSG_NOSIGNAL);
-    if (Sent <= 0) {
-      return;
-    }
-    Data += Sent;
-    Length -= static_cast<size_t>(Sent);
-  }
-}
-
 // An answer carrying only a header (and the 9-byte error body) in place of
 // Frame's: an interim answer, or an unsolicited notification.
 Bytes Companion(const Bytes &Answer, uint32_t Status, uint16_t Command, uint64_t MessageId) {
@@ -72,21 +39,6 @@ Bytes Companion(const Bytes &Answer, uint32_t Status, uint16_t Command, uint64_t
   Bytes Body = {9, 0, 0, 0, 0, 0, 0, 0, 0};
   Message.insert(Message.end(), Body.begin(), Body.end());
   return MockSmb::Frame(Message);
-}
-
-int Listen(uint16_t *Port) {
-  int Fd = socket(AF_INET, SOCK_STREAM, 0);
-  sockaddr_in Addr = {};
-  Addr.sin_family = AF_INET;
-  Addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t Size = sizeof(Addr);
-  if (bind(Fd, reinterpret_cast<sockaddr *>(&Addr), Size) != 0 || listen(Fd, 1) != 0 ||
-      getsockname(Fd, reinterpret_cast<sockaddr *>(&Addr), &Size) != 0) {
-    close(Fd);
-    return -1;
-  }
-  *Port = ntohs(Addr.sin_port);
-  return Fd;
 }
 
 int Dial(uint16_t Port) {
@@ -106,7 +58,7 @@ int Dial(uint16_t Port) {
 
 Relay::Relay(std::vector<Fault> List, uint16_t Server)
     : Faults(std::move(List)), ServerPort(Server) {
-  ListenFd = Listen(&ListenPort);
+  ListenFd = ListenOnLoopback(&ListenPort);
   LastByteNs = NowNs();
   Worker = std::thread([this] { Run(); });
 }
@@ -126,7 +78,7 @@ double Relay::SecondsSinceLastByte() const {
 }
 
 void Relay::SendToClient(int Client, const Bytes &Data) {
-  SendAll(Client, Data.data(), Data.size());
+  WriteAll(Client, Data.data(), Data.size());
   LastByteNs = NowNs();
 }
 
@@ -243,7 +195,7 @@ void Relay::Serve(int Client, int Server) {
         return;
       }
       Pending.emplace_back(GetLe64(Frame, 28), Frame);
-      SendAll(Server, Frame.data(), Frame.size());
+      WriteAll(Server, Frame.data(), Frame.size());
     }
     if (Fds[1].revents != 0 && (!ReadFrame(Server, Frame) || !Answer(Client, Frame))) {
       return;

@@ -58,10 +58,6 @@ TEST_F(DebugLevelTest, DriverLevel) {
     EXPECT_EQ(Level, Case.Level) << (Case.Data ? Case.Data : "absent");
     EXPECT_TRUE(std::regex_match(Out, std::regex(Case.Console))) << Out;
   }
-  Store(u"QVUIkestDebugLevel", "9");
-  UINT8 Level = 0;
-  EXPECT_EQ(Console([&] { QVUIkestDebugLevelInitialize(&Level); }),
-            "Debuglevel 9 is wrongly set. Setting to highest value!\n");
 }
 
 TEST_F(DebugLevelTest, Smb2Level) {

@@ -3,6 +3,7 @@
 // readers the exported names come from (SMBIOS asset tag, sysInfo.xml), fed
 // with malformed input.
 #include "ExportToNWFS/ExportTasks.h"
+#include "MockSmbServer.h"
 #include "NwFsDrv.h"
 #include "ShareStandIn.h"
 #include "Tasks.h"
@@ -43,21 +44,13 @@ protected:
 // Classification and destination
 // ---------------------------------------------------------------------------
 
+// The types' own names export in the tests below and the e2e scripts; here
+// the names next to them.
 TEST_F(ExportTest, SourceTypesAreClassifiedWholeExceptTheReportPrefix) {
-  struct Case {
-    const CHAR16 *SourceType;
-    UINT32 Kind;
-  };
-  const Case Cases[] = {{u"VML", EXPORT_KIND_LOG},          {u"HWI", EXPORT_KIND_HW_INVENTORY},
-                        {u"ASI", EXPORT_KIND_SW_INVENTORY}, {u"BKP", EXPORT_KIND_BACKUP},
-                        {u"DGR", EXPORT_KIND_TECH_SUPPORT}, {u"DGRxyz", EXPORT_KIND_TECH_SUPPORT},
-                        {u"dgr", EXPORT_KIND_NONE},         {u"VMLx", EXPORT_KIND_NONE},
-                        {u"VM", EXPORT_KIND_NONE},          {u"", EXPORT_KIND_NONE},
-                        {nullptr, EXPORT_KIND_NONE}};
-
-  for (const Case &C : Cases) {
-    EXPECT_EQ(ClassifyExportSource(C.SourceType), C.Kind) << HostUcs2ToUtf8(C.SourceType);
+  for (const CHAR16 *Type : {u"dgr", u"VMLx", u"VM", u"", static_cast<const CHAR16 *>(nullptr)}) {
+    EXPECT_EQ(ClassifyExportSource(Type), EXPORT_KIND_NONE) << HostUcs2ToUtf8(Type);
   }
+  EXPECT_EQ(ClassifyExportSource(u"DGRxyz"), EXPORT_KIND_TECH_SUPPORT);
 }
 
 TEST_F(ExportTest, ShareWithoutDriveNameIsNotFound) {
@@ -148,11 +141,11 @@ TEST_F(ExportTest, TechnicalSupportReportExportsEveryFileUnderItsName) {
 }
 
 // ---------------------------------------------------------------------------
-// SMBIOS asset tag
+// The readers, fed with malformed input in buffers of exactly its length
 // ---------------------------------------------------------------------------
 
-// A structure: type, formatted length, the formatted bytes after the header,
-// then the strings and the closing NUL.
+// An SMBIOS structure: type, formatted length, the formatted bytes after the
+// header, then the strings and the closing NUL.
 std::vector<UINT8> Structure(UINT8 Type, std::vector<UINT8> Formatted,
                              std::vector<std::string> Strings) {
   std::vector<UINT8> Out = {Type, static_cast<UINT8>(4 + Formatted.size()), 0x00, 0x01};
@@ -168,90 +161,51 @@ std::vector<UINT8> Structure(UINT8 Type, std::vector<UINT8> Formatted,
   return Out;
 }
 
-// A chassis record whose asset tag is string AssetString.
+// A chassis record (manufacturer, rack mount) whose asset tag is string
+// AssetString.
 std::vector<UINT8> Chassis(UINT8 AssetString, std::vector<std::string> Strings) {
   std::vector<UINT8> Formatted(0x15 - 4, 0);
-  Formatted[0] = 1;               // manufacturer
-  Formatted[1] = 0x17;            // rack mount
-  Formatted[8 - 4] = AssetString; // asset tag
+  Formatted[0] = 1;
+  Formatted[1] = 0x17;
+  Formatted[8 - 4] = AssetString;
   return Structure(3, Formatted, Strings);
 }
 
-std::vector<UINT8> Join(std::initializer_list<std::vector<UINT8>> Parts) {
-  std::vector<UINT8> Out;
-  for (const auto &P : Parts) {
-    Out.insert(Out.end(), P.begin(), P.end());
-  }
-  return Out;
-}
-
-std::string AssetTagOf(const std::vector<UINT8> &Table, EFI_STATUS *Status, size_t Length = 0) {
-  CHAR8 Tag[EXPORT_TAG_CHARS];
-  *Status = SmbiosFindChassisAssetTag(Table.data(), Length != 0 ? Length : Table.size(), Tag,
-                                      sizeof(Tag));
-  return Tag;
-}
-
 TEST_F(ExportTest, MalformedSmbiosTablesAreRejectedWithinTheirBounds) {
-  EFI_STATUS Status;
-  struct Case {
+  std::vector<UINT8> Good = Chassis(1, {"TAG1"});
+  std::vector<UINT8> ZeroLength = Good, PastEnd = Good;
+  ZeroLength[1] = 0;
+  PastEnd[1] = 0xF0;
+  const struct {
     const char *Name;
     std::vector<UINT8> Table;
-    size_t Length; // 0: the whole table
     EFI_STATUS Expected;
+  } Cases[] = {
+      {"length below the header", ZeroLength, EFI_COMPROMISED_DATA},
+      {"length past the table", PastEnd, EFI_COMPROMISED_DATA},
+      {"strings without their end", {Good.begin(), Good.end() - 2}, EFI_COMPROMISED_DATA},
+      {"table cut inside the header", {Good.begin(), Good.begin() + 3}, EFI_NOT_FOUND},
+      {"asset tag string beyond the set", Chassis(4, {"a", "b"}), EFI_NOT_FOUND},
+      {"no asset tag string", Chassis(0, {"a"}), EFI_NOT_FOUND},
+      {"blank asset tag", Chassis(1, {"   "}), EFI_NOT_FOUND},
+      {"short chassis record", Structure(3, {1, 2, 3}, {"x"}), EFI_NOT_FOUND},
+      {"end of table first", MockSmb::Concat({Structure(127, {}, {}), Good}), EFI_NOT_FOUND},
+      {"no chassis record", Structure(1, {1, 2, 3, 4}, {"sys"}), EFI_NOT_FOUND},
   };
-  std::vector<UINT8> Good = Chassis(1, {"TAG1"});
-  std::vector<UINT8> ZeroLength = Good;
-  ZeroLength[1] = 0;
-  std::vector<UINT8> PastEnd = Good;
-  PastEnd[1] = 0xF0;
-  std::vector<UINT8> Unterminated(Good.begin(), Good.end() - 2); // strings run to the end
-  std::vector<UINT8> Short = Structure(3, {1, 2, 3}, {"x"});     // no asset tag field
-  const Case Cases[] = {
-      {"length below the header", ZeroLength, 0, EFI_COMPROMISED_DATA},
-      {"length past the table", PastEnd, 0, EFI_COMPROMISED_DATA},
-      {"strings without their end", Unterminated, 0, EFI_COMPROMISED_DATA},
-      {"table cut inside the header", Good, 3, EFI_NOT_FOUND},
-      {"asset tag string beyond the set", Chassis(4, {"a", "b"}), 0, EFI_NOT_FOUND},
-      {"no asset tag string", Chassis(0, {"a"}), 0, EFI_NOT_FOUND},
-      {"blank asset tag", Chassis(1, {"   "}), 0, EFI_NOT_FOUND},
-      {"short chassis record", Short, 0, EFI_NOT_FOUND},
-      {"end of table first", Join({Structure(127, {}, {}), Good}), 0, EFI_NOT_FOUND},
-      {"no chassis record", Structure(1, {1, 2, 3, 4}, {"sys"}), 0, EFI_NOT_FOUND},
-  };
-  for (const Case &C : Cases) {
-    // A copy of exactly the bytes given, so that any read past them is seen.
-    std::vector<UINT8> Exact(C.Table.begin(),
-                             C.Table.begin() + (C.Length != 0 ? C.Length : C.Table.size()));
-    AssetTagOf(Exact, &Status);
-    EXPECT_EQ(Status, C.Expected) << C.Name;
+  for (const auto &C : Cases) {
+    std::vector<UINT8> Exact(C.Table.begin(), C.Table.end()); // any read past it is seen
+    CHAR8 Tag[EXPORT_TAG_CHARS];
+    EXPECT_EQ(SmbiosFindChassisAssetTag(Exact.data(), Exact.size(), Tag, sizeof(Tag)), C.Expected)
+        << C.Name;
   }
-}
-
-// ---------------------------------------------------------------------------
-// sysInfo.xml
-// ---------------------------------------------------------------------------
-
-EFI_STATUS ReadElement(const std::string &Text, const char *Element, std::string *Value,
-                       size_t Size = 32) {
-  std::vector<CHAR8> Buffer(Size);
-  EFI_STATUS Status = EFI_SUCCESS;
-  // The text is handed over in a buffer of exactly its length.
-  std::vector<CHAR8> Exact(Text.begin(), Text.end());
-  HostConsoleCaptureBegin();
-  Status = XmlReadElement(Exact.data(), Exact.size(), Element, Buffer.data(), Size);
-  HostConsoleCaptureEnd();
-  *Value = Buffer.data();
-  return Status;
 }
 
 TEST_F(ExportTest, ElementReaderAcceptsOnlyTheOnePlainElement) {
-  struct Case {
+  const struct {
     std::string Text;
     EFI_STATUS Status;
     const char *Value;
-  };
-  const Case Cases[] = {
+  } Cases[] = {
       {"<a><Tag>V1</Tag></a>", EFI_SUCCESS, "V1"},
       {"<TagX>no</TagX><Tag>yes</Tag>", EFI_SUCCESS, "yes"},
       {"<Tags>no</Tags>", EFI_NOT_FOUND, ""},
@@ -267,22 +221,24 @@ TEST_F(ExportTest, ElementReaderAcceptsOnlyTheOnePlainElement) {
       {"<Tag>" + std::string(31, 'x') + "</Tag>", EFI_SUCCESS, nullptr},
       {"<Tag>" + std::string(32, 'x') + "</Tag>", EFI_BUFFER_TOO_SMALL, ""},
   };
-  for (const Case &C : Cases) {
-    std::string Value;
-    EXPECT_EQ(ReadElement(C.Text, "Tag", &Value), C.Status) << C.Text;
-    EXPECT_EQ(Value, C.Value != nullptr ? C.Value : std::string(31, 'x')) << C.Text;
+  for (const auto &C : Cases) {
+    std::vector<CHAR8> Exact(C.Text.begin(), C.Text.end()), Value(32);
+    EXPECT_EQ(Quiet([&] {
+                return XmlReadElement(Exact.data(), Exact.size(), "Tag", Value.data(),
+                                      Value.size());
+              }),
+              C.Status)
+        << C.Text;
+    EXPECT_EQ(Value.data(), C.Value != nullptr ? C.Value : std::string(31, 'x')) << C.Text;
   }
 }
 
 TEST_F(ExportTest, TimeStampsMustBeRealTimes) {
   EFI_TIME Time = {};
   ASSERT_EQ(ParseXmlTimeStamp("2024-02-29T23:59:59", &Time), EFI_SUCCESS);
-  EXPECT_EQ(Time.Year, 2024);
-  EXPECT_EQ(Time.Month, 2);
-  EXPECT_EQ(Time.Day, 29);
-  EXPECT_EQ(Time.Hour, 23);
-  EXPECT_EQ(Time.Minute, 59);
-  EXPECT_EQ(Time.Second, 59);
+  EXPECT_EQ(
+      std::vector<int>({Time.Year, Time.Month, Time.Day, Time.Hour, Time.Minute, Time.Second}),
+      std::vector<int>({2024, 2, 29, 23, 59, 59}));
   EXPECT_EQ(ParseXmlTimeStamp("2000-02-29T00:00:00", &Time), EFI_SUCCESS);
   for (const char *Bad :
        {"1900-02-29T00:00:00", "2023-02-29T00:00:00", "2024-04-31T00:00:00", "2024-13-01T00:00:00",

@@ -45,34 +45,26 @@ TEST_F(MainTest, WrongArgumentCountIsRefusedButStillRecordedAndUnmounted) {
 }
 
 TEST_F(MainTest, ArgumentCheckLetsTheLastArgumentDecide) {
-  std::string Long(600, 'x');
-  std::string Short = "pw";
-  char Name[] = "CIFSDrv.efi", Action[] = "G", Share[] = "share", Ip[] = "127.0.0.1";
-  {
-    char *Argv[] = {Name, Action, Share, Ip, Long.data(), Short.data(), nullptr};
-    std::string Out = Console([&] { EXPECT_EQ(ValidateArguments(6, Argv, 4, 9), EFI_SUCCESS); });
-    EXPECT_NE(Out.find("Invalid Parameters 4\n"), std::string::npos);
-  }
-  {
-    char *Argv[] = {Name, Action, Share, Ip, Short.data(), Long.data(), nullptr};
+  std::string Long(600, 'x'), Limit(511, 'y'), Over(512, 'y');
+  char Name[] = "CIFSDrv.efi", Action[] = "G", Share[] = "share", Ip[] = "127.0.0.1", Pw[] = "pw";
+  struct Case {
+    std::vector<char *> Argv;
+    EFI_STATUS Status;
+    const char *Line;
+  } Cases[] = {
+      {{Name, Action, Share, Ip, Long.data(), Pw}, EFI_SUCCESS, "Invalid Parameters 4\n"},
+      {{Name, Action, Share, Ip, Pw, Long.data()}, EFI_INVALID_PARAMETER, "Invalid Parameters 5\n"},
+      {{Name, Action, Share, Limit.data()}, EFI_SUCCESS, ""},
+      {{Name, Action, Share, Over.data()}, EFI_INVALID_PARAMETER, ""},
+      // A missing argument ends the check at once, even before a valid one.
+      {{Name, Action, nullptr, Ip, Pw}, EFI_INVALID_PARAMETER, "Parameters 2 is NULL\n"},
+  };
+  for (Case &C : Cases) {
+    INTN Count = static_cast<INTN>(C.Argv.size());
+    C.Argv.push_back(nullptr);
     std::string Out =
-        Console([&] { EXPECT_EQ(ValidateArguments(6, Argv, 4, 9), EFI_INVALID_PARAMETER); });
-    EXPECT_NE(Out.find("Invalid Parameters 5\n"), std::string::npos);
-  }
-  {
-    std::string Limit(511, 'y');
-    char *Argv[] = {Name, Action, Share, Limit.data(), nullptr};
-    EXPECT_EQ(ValidateArguments(4, Argv, 4, 9), EFI_SUCCESS);
-    std::string Over(512, 'y');
-    Argv[3] = Over.data();
-    Console([&] { EXPECT_EQ(ValidateArguments(4, Argv, 4, 9), EFI_INVALID_PARAMETER); });
-  }
-  {
-    // A missing argument ends the check at once, even before a valid one.
-    char *Argv[] = {Name, Action, nullptr, Ip, Short.data(), nullptr};
-    std::string Out =
-        Console([&] { EXPECT_EQ(ValidateArguments(5, Argv, 4, 9), EFI_INVALID_PARAMETER); });
-    EXPECT_NE(Out.find("Parameters 2 is NULL\n"), std::string::npos);
+        Console([&] { EXPECT_EQ(ValidateArguments(Count, C.Argv.data(), 4, 9), C.Status); });
+    EXPECT_NE(Out.find(C.Line), std::string::npos) << Out;
   }
 }
 

@@ -11,26 +11,13 @@
 #include "volume/NWLib.h"
 #include "volume/NwVolume.h"
 
-#include <arpa/inet.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
-#include <unistd.h>
-
 namespace {
 
 using namespace MockSmb;
 
-// A loopback port nothing listens on: bound, then closed again.
+// A loopback port nothing listens on: a server's, bound but never started.
 uint16_t ClosedPort() {
-  int Fd = socket(AF_INET, SOCK_STREAM, 0);
-  sockaddr_in Address = {};
-  Address.sin_family = AF_INET;
-  Address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t Length = sizeof(Address);
-  bind(Fd, reinterpret_cast<sockaddr *>(&Address), sizeof(Address));
-  getsockname(Fd, reinterpret_cast<sockaddr *>(&Address), &Length);
-  close(Fd);
-  return ntohs(Address.sin_port);
+  return Server().Port();
 }
 
 class MountTest : public HostImageTest {

@@ -3,7 +3,9 @@
 // is recorded. Reads (the 1 MiB cap, whole chunks, the process-wide offset),
 // writes (requests of at most 64512 bytes at the never-reset offset),
 // listings (n + 1 reads), information, answers the volume must not trust,
-// the status record the network library keeps, and the login splitter.
+// renames to directory names, whole runs of the image and the outcome they
+// record, the status record the network library keeps, and the login
+// splitter.
 #include "ScriptedVolume.h"
 
 namespace {
@@ -221,6 +223,133 @@ TEST_F(NwDataPathTest, OpenAndInformationReachTheBackEndByPath) {
   EXPECT_EQ(Size, 84u);
   EXPECT_EQ(FileInfo->FileName[0], 0);
   Close(File);
+}
+
+// "", "." and ".." name the directories above a file, never a new name for
+// it: the rename changes nothing, and the path stays open for later opens.
+TEST_F(NwDataPathTest, RenameToADirectoryNameChangesNothing) {
+  Put("dir", "", true);
+  Put("dir\\f.img", "data");
+  auto NameOf = [](EFI_FILE_PROTOCOL *File, std::vector<UINT8> *Info) {
+    Info->assign(512, 0);
+    UINTN Size = Info->size();
+    Quiet([&] { return File->GetInfo(File, &gEfiFileInfoGuid, &Size, Info->data()); });
+    return Narrow(reinterpret_cast<EFI_FILE_INFO *>(Info->data())->FileName);
+  };
+  for (const char16_t *Name : {u"", u".", u".."}) {
+    SCOPED_TRACE(Narrow(Name));
+    EFI_FILE_PROTOCOL *File = Open(u"dir\\f.img", 3);
+    std::vector<UINT8> Info;
+    ASSERT_EQ(NameOf(File, &Info), "f.img");
+    Info = NamedInfo(Info, Name);
+    EXPECT_EQ(
+        Quiet([&] { return File->SetInfo(File, &gEfiFileInfoGuid, Info.size(), Info.data()); }),
+        EFI_SUCCESS);
+    EXPECT_EQ(NameOf(File, &Info), "f.img");
+    EFI_FILE_PROTOCOL *Again = Open(u"dir\\f.img");
+    EXPECT_EQ(NameOf(Again, &Info), "f.img");
+    Close(Again);
+    Close(File);
+  }
+}
+
+// ---------------------------------------------------------------------------
+// Whole runs of the image over the scripted share: VerifyStatus is 0 only
+// when the file arrived whole
+// ---------------------------------------------------------------------------
+class OutcomeTest : public HostImageTest {
+protected:
+  void SetUp() override {
+    HostImageTest::SetUp();
+    gNwBackend = &kScripted;
+  }
+  void TearDown() override {
+    gNwBackend = &gSMB2FsBackend;
+    gShare = nullptr;
+    HostImageTest::TearDown();
+  }
+};
+
+// Pool blocks freed while they still begin with the password, 8-bit or UCS-2
+// (compared a byte at a time, so that nothing past a short block is read).
+int gSecretsFreed = 0;
+EFI_STATUS(EFIAPI *gRealFreePool)(void *) = nullptr;
+EFI_STATUS EFIAPI CheckedFreePool(void *Buffer) {
+  auto *Bytes = static_cast<const char *>(Buffer);
+  auto BeginsWith = [&](const void *Text, size_t Length) {
+    return std::mismatch(Bytes, Bytes + Length, static_cast<const char *>(Text)).first ==
+           Bytes + Length;
+  };
+  gSecretsFreed += BeginsWith("Zq7-Secret", 10) || BeginsWith(u"Zq7-Secret", 20);
+  return gRealFreePool(Buffer);
+}
+
+TEST_F(OutcomeTest, SuccessMeansTheFileArrivedWhole) {
+  using Args = std::vector<std::string>;
+  const Args Import = {"CIFSDrv.efi", "I", "share", "127.0.0.1", "u", "Zq7-Secret", "f.img"};
+  const Args Catalog = {"CIFSDrv.efi", "G", "share", "127.0.0.1", "u", "Zq7-Secret"};
+  const Args Export = {"CIFSDrv.efi", "e",   "share", "127.0.0.1",
+                       "Export",      "VML", "u",     "Zq7-Secret"};
+  Args Mount = Export;
+  Mount[1] = "m";
+  const std::string Data(300, 'd');
+  const char *const F = "f.img";
+  struct Case {
+    const char *Name;
+    const Args &Line;
+    const char *File; // the one file on the share
+    ScriptedShare Share;
+    int Status;
+    const char *InRamfs; // whole in ramfs: afterwards, or null: nothing there
+  } Cases[] = {
+      {"import", Import, F, {}, 0, F},
+      {"import, no data at all", Import, F, {.ReadStop = 0}, 7, nullptr},
+      {"import, no data after a few bytes", Import, F, {.ReadStop = 10}, 7, nullptr},
+      {"import, reset", Import, F, {.ReadStop = 10, .ReadFailure = EFI_DEVICE_ERROR}, 7, nullptr},
+      {"import, no such file", Import, "other.img", {}, 0x0E, nullptr},
+      {"catalog", Catalog, "catalog.xml.gz", {}, 0, "catalog.xml.gz"},
+      {"catalog, cut short", Catalog, "catalog.xml.gz", {.ReadStop = 10}, 7, nullptr},
+      {"export", Export, F, {}, 0, nullptr},
+      {"export, short write", Export, F, {.MaxPerCall = 1}, 7, nullptr},
+      {"mount", Mount, F, {}, 0, nullptr},
+      {"mount, root does not open", Mount, F, {.FsInfoStatus = EFI_DEVICE_ERROR}, 7, nullptr},
+  };
+  gRealFreePool = gBS->FreePool;
+  gBS->FreePool = CheckedFreePool;
+  for (Case &C : Cases) {
+    SCOPED_TRACE(C.Name);
+    C.Share.Nodes[C.File].Data = Data;
+    gShare = &C.Share;
+    std::filesystem::remove_all(RamfsDir);
+    WriteFile(RamfsDir + "/VelmorLog.xml", "log");
+    std::vector<UINT8> Record(sizeof(PU_PROVISIONING_RECORD), 0);
+    memcpy(Record.data() + offsetof(PU_PROVISIONING_RECORD, CifsCatalogPath), "CIFS:\\old", 9);
+    WriteVar(PU_PROVISIONING_VAR_NAME, gPUProvisioningEnvGuid, PROVISIONING_NV_ATTRIBUTES, Record);
+    std::string Out;
+    RunImage(C.Line, &Out);
+    Variable Outcome = ReadVar(PROVISIONING_VOLATILE_VAR_NAME, gProvisioningEnvGuid);
+    EXPECT_EQ(Outcome.Data.at(0), C.Status) << Out;
+    for (std::string Name : {F, "catalog.xml.gz"}) {
+      bool Whole = C.InRamfs != nullptr && Name == C.InRamfs;
+      EXPECT_EQ(ReadFile(RamfsDir + "/" + Name), Whole ? Data : "") << Name;
+    }
+    // A catalog copy that broke ends the search and leaves the place remembered.
+    EXPECT_EQ(
+        std::count(C.Share.Calls.begin(), C.Share.Calls.end(), Call{"list", "repository", 0, 0}),
+        0);
+    Variable Kept = ReadVar(PU_PROVISIONING_VAR_NAME, gPUProvisioningEnvGuid);
+    EXPECT_STREQ(reinterpret_cast<char *>(Kept.Data.data()) +
+                     offsetof(PU_PROVISIONING_RECORD, CifsCatalogPath),
+                 &C.Line == &Catalog && C.Status == 0 ? "CIFS:" : "CIFS:\\old");
+    // The mount takes the root the shell-name lookup opened (two statistics
+    // queries for a new root), or failed to open, and sends nothing else.
+    if (&C.Line == &Mount) {
+      EXPECT_EQ(C.Share.Calls, std::vector<Call>(C.Status == 0 ? 2 : 1, Call{"fsinfo", "", 0, 0}));
+    }
+  }
+  gBS->FreePool = gRealFreePool;
+  EXPECT_EQ(gSecretsFreed, 0);
+  EXPECT_EQ(HostPoolOutstanding(), PoolAtStart);
 }
 
 // ---------------------------------------------------------------------------

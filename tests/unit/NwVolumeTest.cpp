@@ -283,34 +283,6 @@ TEST_F(NwVolumeTest, DeleteThroughOneHandleInvalidatesTheOthers) {
   EXPECT_EQ(Val(RootRecord->Children.Count), 0u);
 }
 
-// A directory deleted while a handle on one of its children is open: the
-// directory's record stays for the child, and every order of closing the
-// rest frees everything exactly once.
-TEST_F(NwVolumeTest, DeletingADirectoryUnderAnOpenChild) {
-  const int Orders[][2] = {{0, 1}, {1, 0}};
-  for (const auto &Order : Orders) {
-    DiscardDirEntries(RootRecord);
-    Seed(RootRecord, {{u"D", EFI_FILE_DIRECTORY, 0}});
-    EFI_FILE_PROTOCOL *Dir = nullptr, *Other = nullptr, *Inner = nullptr;
-    ASSERT_EQ(OpenFrom(Root, u"D", &Dir, 3), EFI_SUCCESS);
-    NW_OPEN_FILE *D = NwHandleOf(Dir)->OpenFile;
-    Seed(D, {{u"E", EFI_FILE_DIRECTORY, 0}});
-    ASSERT_EQ(OpenFrom(Dir, u"E", &Inner), EFI_SUCCESS);
-    ASSERT_EQ(OpenFrom(Root, u"D", &Other), EFI_SUCCESS);
-    DiscardDirEntries(D); // D's listing is not cached: deletable
-    EXPECT_EQ(Quiet([&] { return Dir->Delete(Dir); }), EFI_SUCCESS);
-    EXPECT_EQ(Val(NwHandleOf(Other)->OpenFile), nullptr);
-    EXPECT_EQ(Val(D->HandleCount), 0); // kept alive by its child only
-    EXPECT_EQ(Val(NwHandleOf(Inner)->OpenFile->Parent), D);
-    EFI_FILE_PROTOCOL *Left[] = {Other, Inner};
-    for (int I : Order) {
-      Quiet([&] { EXPECT_EQ(Left[I]->Close(Left[I]), EFI_SUCCESS); });
-    }
-    EXPECT_EQ(Val(Volume->OpenFiles.Count), 1u);
-    EXPECT_EQ(Val(Volume->FileHandles.Count), 1u);
-  }
-}
-
 // A rename moves the handle to a record of the new name; the old record
 // goes, nothing is asked of the share.
 TEST_F(NwVolumeTest, RenamingADirectoryMovesTheHandle) {
@@ -362,23 +334,39 @@ TEST_F(NwVolumeTest, DeleteRefusalsCloseTheHandle) {
   }
 }
 
-TEST_F(NwVolumeTest, ClosesInEveryOrderLeaveNothingBehind) {
+// Handles on a directory D and on its child E closed in every order, or D
+// deleted first through one of them while E is open (D's record then stays
+// for its child, and the other handle on D is no longer valid): every record
+// and handle goes, exactly once.
+TEST_F(NwVolumeTest, ClosesAndDeletesInEveryOrderLeaveNothingBehind) {
   Seed(RootRecord, {{u"D", EFI_FILE_DIRECTORY, 0}});
-  UINT64 BytesAtStart = Volume->AllocatedBytes;
-  const int Orders[][3] = {{0, 1, 2}, {2, 1, 0}, {1, 0, 2}, {1, 2, 0}};
-  for (const auto &Order : Orders) {
-    EFI_FILE_PROTOCOL *H[3] = {};
-    NW_OPEN_FILE *D = Child(RootRecord, u"D");
+  const UINT64 BytesAtStart = Volume->AllocatedBytes;
+  const struct {
+    bool Delete; // through H[0], before the closes
+    std::vector<int> Closes;
+  } Cases[] = {{false, {0, 1, 2, 3}}, {false, {3, 2, 1, 0}}, {false, {1, 0, 2, 3}},
+               {false, {2, 1, 3, 0}}, {true, {1, 2, 3}},     {true, {3, 2, 1}}};
+  for (const auto &C : Cases) {
+    EFI_FILE_PROTOCOL *H[4] = {};
+    ASSERT_EQ(OpenFrom(Root, u"D", &H[0], 3), EFI_SUCCESS);
+    NW_OPEN_FILE *D = NwHandleOf(H[0])->OpenFile;
     Seed(D, {{u"E", EFI_FILE_DIRECTORY, 0}});
-    ASSERT_EQ(OpenFrom(Root, u"D", &H[0]), EFI_SUCCESS);
-    ASSERT_EQ(OpenFrom(Root, u"D\\E", &H[1]), EFI_SUCCESS);
-    ASSERT_EQ(OpenFrom(H[0], u"E", &H[2]), EFI_SUCCESS);
-    for (int I : Order) {
-      Quiet([&] { H[I]->Close(H[I]); });
+    ASSERT_EQ(OpenFrom(H[0], u"E", &H[1]), EFI_SUCCESS);
+    ASSERT_EQ(OpenFrom(Root, u"D\\E", &H[2]), EFI_SUCCESS);
+    ASSERT_EQ(OpenFrom(Root, u"d", &H[3]), EFI_SUCCESS);
+    if (C.Delete) {
+      DiscardDirEntries(D); // D's listing is not cached: deletable
+      EXPECT_EQ(Quiet([&] { return H[0]->Delete(H[0]); }), EFI_SUCCESS);
+      EXPECT_EQ(Val(NwHandleOf(H[3])->OpenFile), nullptr);
+      EXPECT_EQ(Val(D->HandleCount), 0);
+      EXPECT_EQ(Val(NwHandleOf(H[1])->OpenFile->Parent), D);
     }
-    // D may have gone with its last child; what is left goes now.
+    for (int I : C.Closes) {
+      Quiet([&] { EXPECT_EQ(H[I]->Close(H[I]), EFI_SUCCESS); });
+    }
+    // Unless deleted, D may stay for its cached listing; it goes now.
     NW_OPEN_FILE *Left = nullptr;
-    if (!EFI_ERROR(FindMatchingFH(Volume, u"D", RootRecord, &Left))) {
+    if (!C.Delete && !EFI_ERROR(FindMatchingFH(Volume, u"D", RootRecord, &Left))) {
       DiscardDirEntries(Left);
       EXPECT_EQ(ReleaseOpenFile(Left), EFI_SUCCESS);
     }

@@ -38,12 +38,15 @@ struct Node {
 };
 
 struct ScriptedShare {
-  std::map<std::string, Node> Nodes;
-  std::vector<Call> Calls;
+  std::map<std::string, Node> Nodes = {};
+  std::vector<Call> Calls = {};
   UINT64 MaxPerCall = ~0ULL; // the most a read or write call moves
   UINT64 Extra = 0;          // reported beyond what a read or write moved
   EFI_STATUS Status = EFI_SUCCESS;
-  std::vector<std::string> Listing; // paths of the listing being handed out
+  UINT64 ReadStop = ~0ULL;               // bytes of a file served before reads misbehave
+  EFI_STATUS ReadFailure = EFI_SUCCESS;  // then: this error, or an answer without data
+  EFI_STATUS FsInfoStatus = EFI_SUCCESS; // of every file-system information call
+  std::vector<std::string> Listing = {}; // paths of the listing being handed out
   size_t Next = 0;
   size_t Prefix = 0; // characters of the directory's path in front of a name
 } *gShare = nullptr;
@@ -86,11 +89,12 @@ EFI_STATUS Read(NW_SHARE_INFO *, NW_REMOTE_FILE *File, void *Buffer, UINTN *Size
   std::string Path = Narrow(File->FileName);
   Recorded("read", Path, *Size, At);
   const std::string &Data = gShare->Nodes[Path].Data;
-  UINT64 Count = At >= Data.size() ? 0 : std::min<UINT64>(*Size, Data.size() - At);
+  UINT64 End = std::min<UINT64>(Data.size(), gShare->ReadStop);
+  UINT64 Count = At >= End ? 0 : std::min<UINT64>(*Size, End - At);
   Count = std::min(Count, gShare->MaxPerCall);
   memcpy(Buffer, Data.data() + std::min<UINT64>(At, Data.size()), Count);
   *Size = Count + gShare->Extra;
-  return gShare->Status;
+  return At >= End && End < Data.size() ? gShare->ReadFailure : gShare->Status;
 }
 EFI_STATUS Write(NW_SHARE_INFO *, NW_REMOTE_FILE *File, const void *Buffer, UINTN *Size,
                  UINT64 At) {
@@ -111,7 +115,8 @@ EFI_STATUS FsInfo(NW_SHARE_INFO *, EFI_FILE_SYSTEM_INFO *Info) {
   Info->VolumeSize = 3 * kMiB;
   Info->FreeSpace = kMiB;
   Info->BlockSize = 4096;
-  return Recorded("fsinfo", "");
+  Recorded("fsinfo", "");
+  return gShare->FsInfoStatus;
 }
 EFI_STATUS FindNext(EFI_FILE_INFO **Entry) {
   if (gShare->Next >= gShare->Listing.size()) {

@@ -189,6 +189,7 @@ protected:
     HostImageTest::SetUp();
     ShareDir = RamfsDir + "/share";
     std::filesystem::create_directories(ShareDir);
+    BeforeInstall();
     Console([&] {
       InitializeSystemEnv(gImageHandle, gST);
       Share.Install(u"share");
@@ -201,6 +202,9 @@ protected:
     Share.Uninstall();
     HostImageTest::TearDown();
   }
+
+  // Runs in SetUp once the environment is there, before the shell is bound.
+  virtual void BeforeInstall() {}
 
   // The text-field record the catalog tasks persist into, as other firmware
   // components would have created it.

@@ -30,13 +30,6 @@ FakeVolume *FromRoot(EFI_FILE_PROTOCOL *Root) {
                                         offsetof(FakeVolume, Root));
 }
 
-EFI_STATUS EFIAPI FakeOpenVolume(EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *This, EFI_FILE_PROTOCOL **Root) {
-  FakeVolume *Volume = reinterpret_cast<FakeVolume *>(This);
-  Volume->OpenRoots++;
-  *Root = &Volume->Root;
-  return EFI_SUCCESS;
-}
-
 EFI_STATUS EFIAPI FakeGetInfo(EFI_FILE_PROTOCOL *This, const EFI_GUID *Type, UINTN *Size,
                               void *Buffer) {
   FakeVolume *Volume = FromRoot(This);
@@ -44,50 +37,22 @@ EFI_STATUS EFIAPI FakeGetInfo(EFI_FILE_PROTOCOL *This, const EFI_GUID *Type, UIN
     return EFI_UNSUPPORTED;
   }
   UINTN Chars = std::char_traits<char16_t>::length(Volume->Label);
-  UINTN Needed = SIZE_OF_EFI_FILE_SYSTEM_INFO + (Chars + 1) * sizeof(CHAR16);
-  if (Volume->RequiredSize > Needed) {
-    Needed = Volume->RequiredSize;
-  }
+  UINTN Needed = std::max<UINTN>(Volume->RequiredSize,
+                                 SIZE_OF_EFI_FILE_SYSTEM_INFO + (Chars + 1) * sizeof(CHAR16));
   if (*Size < Needed) {
     *Size = Needed;
     return EFI_BUFFER_TOO_SMALL;
   }
   memset(Buffer, 0, Needed);
   auto *Info = static_cast<EFI_FILE_SYSTEM_INFO *>(Buffer);
-  Info->Size = Needed;
-  UINTN Room = (Needed - SIZE_OF_EFI_FILE_SYSTEM_INFO) / sizeof(CHAR16);
-  for (UINTN Index = 0; Index < Room; Index++) {
-    // Unterminated: the label's characters repeat to the very end.
-    CHAR16 Character = Index < Chars ? Volume->Label[Index] : 0;
-    if (!Volume->TerminateLabel) {
-      Character = Volume->Label[Index % Chars];
-    }
-    Info->VolumeLabel[Index] = Character;
+  Info->Size = *Size = Needed;
+  // Unterminated: the label's characters repeat to the very end.
+  for (UINTN Index = 0; Index < (Needed - SIZE_OF_EFI_FILE_SYSTEM_INFO) / sizeof(CHAR16); Index++) {
+    Info->VolumeLabel[Index] = !Volume->TerminateLabel ? Volume->Label[Index % Chars]
+                               : Index < Chars         ? Volume->Label[Index]
+                                                       : 0;
   }
-  *Size = Needed;
   return EFI_SUCCESS;
-}
-
-EFI_STATUS EFIAPI FakeClose(EFI_FILE_PROTOCOL *This) {
-  FromRoot(This)->OpenRoots--;
-  return EFI_SUCCESS;
-}
-
-void InitFakeVolume(FakeVolume *Volume, const char16_t *Label, UINT32 Tag) {
-  memset(Volume, 0, sizeof(*Volume));
-  Volume->Fs.Revision = EFI_SIMPLE_FILE_SYSTEM_PROTOCOL_REVISION;
-  Volume->Fs.OpenVolume = FakeOpenVolume;
-  Volume->Root.Revision = EFI_FILE_PROTOCOL_REVISION;
-  Volume->Root.Open = [](EFI_FILE_PROTOCOL *, EFI_FILE_PROTOCOL **, const CHAR16 *, UINT64,
-                         UINT64) -> EFI_STATUS { return EFI_NOT_FOUND; };
-  Volume->Root.Close = FakeClose;
-  Volume->Root.GetInfo = FakeGetInfo;
-  std::char_traits<char16_t>::copy(Volume->Label, Label,
-                                   std::char_traits<char16_t>::length(Label) + 1);
-  Volume->TerminateLabel = true;
-  Volume->Path.Header = {HARDWARE_DEVICE_PATH, HW_VENDOR_DP, {20, 0}};
-  Volume->Path.Guid = {Tag, 0x1234, 0x5678, {1, 2, 3, 4, 5, 6, 7, 8}};
-  Volume->Path.End = {END_DEVICE_PATH_TYPE, END_ENTIRE_DEVICE_PATH_SUBTYPE, {4, 0}};
 }
 
 class ShellCommandTest : public HostImageTest {
@@ -108,8 +73,27 @@ protected:
   }
 
   FakeVolume *AddVolume(const char16_t *Label, UINT32 Tag) {
-    FakeVolume *Volume = new FakeVolume;
-    InitFakeVolume(Volume, Label, Tag);
+    FakeVolume *Volume = new FakeVolume{};
+    Volume->Fs = {EFI_SIMPLE_FILE_SYSTEM_PROTOCOL_REVISION,
+                  [](EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *This, EFI_FILE_PROTOCOL **Root) {
+                    reinterpret_cast<FakeVolume *>(This)->OpenRoots++;
+                    *Root = &reinterpret_cast<FakeVolume *>(This)->Root;
+                    return EFI_SUCCESS;
+                  }};
+    Volume->Root.Revision = EFI_FILE_PROTOCOL_REVISION;
+    Volume->Root.Open = [](EFI_FILE_PROTOCOL *, EFI_FILE_PROTOCOL **, const CHAR16 *, UINT64,
+                           UINT64) -> EFI_STATUS { return EFI_NOT_FOUND; };
+    Volume->Root.Close = [](EFI_FILE_PROTOCOL *This) -> EFI_STATUS {
+      FromRoot(This)->OpenRoots--;
+      return EFI_SUCCESS;
+    };
+    Volume->Root.GetInfo = FakeGetInfo;
+    std::char_traits<char16_t>::copy(Volume->Label, Label,
+                                     std::char_traits<char16_t>::length(Label) + 1);
+    Volume->TerminateLabel = true;
+    Volume->Path = {{HARDWARE_DEVICE_PATH, HW_VENDOR_DP, {20, 0}},
+                    {Tag, 0x1234, 0x5678, {1, 2, 3, 4, 5, 6, 7, 8}},
+                    {END_DEVICE_PATH_TYPE, END_ENTIRE_DEVICE_PATH_SUBTYPE, {4, 0}}};
     EXPECT_EQ(gBS->InstallMultipleProtocolInterfaces(
                   &Volume->Handle, &gEfiSimpleFileSystemProtocolGuid, &Volume->Fs,
                   &gEfiDevicePathProtocolGuid, &Volume->Path, nullptr),

@@ -89,6 +89,7 @@ TEST_F(Smb2FramingTest, ConnectParameters) {
     const char *Message; // null: the domain is kept and the address field stays empty
   } Cases[] = {
       {"CORP", EFI_SUCCESS, nullptr},
+      {"0", EFI_SUCCESS, "Domain is NULL!"}, // "0" names no domain either
       {D256.c_str(), EFI_SUCCESS, "Domain is NULL!"},
       {D257.c_str(), EFI_INVALID_PARAMETER,
        "Domain length 257 is greater isexpected length 256. Exiting!\n"},

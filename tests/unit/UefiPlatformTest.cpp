@@ -62,15 +62,7 @@ TEST(InetText, GeneratedTextsAgreeWithLibc) {
 
 EFI_TIME MakeTime(UINT16 Year, UINT8 Month, UINT8 Day, UINT8 Hour = 0, UINT8 Minute = 0,
                   UINT8 Second = 0, INT16 TimeZone = kEfiUnspecifiedTimeZone) {
-  EFI_TIME Time = {};
-  Time.Year = Year;
-  Time.Month = Month;
-  Time.Day = Day;
-  Time.Hour = Hour;
-  Time.Minute = Minute;
-  Time.Second = Second;
-  Time.TimeZone = TimeZone;
-  return Time;
+  return {Year, Month, Day, Hour, Minute, Second, 0, 0, TimeZone, 0, 0};
 }
 
 // Every day of the years where the leap rules differ.
