@@ -2,9 +2,9 @@
 # SMB2 signing against Samba on loopback. With "server signing = mandatory"
 # the actions m, G, I and "e ... Export VML" complete byte-identical, and a
 # capture shows SMB2_FLAGS_SIGNED on every request after the session setup
-# and no malformed packet. Against the default server nothing is signed (and
-# the connect's fields read as they should), unless the SMB2Signing variable
-# asks for it; then everything is, and the run still succeeds.
+# and no malformed packet. Against the default server nothing is signed,
+# unless the SMB2Signing variable asks for it; then everything is, and the
+# run still succeeds.
 #
 # Usage: run-signing.sh PATH_TO_CIFSDRV
 set -u
@@ -32,21 +32,6 @@ signed_requests() {
   tshark -r "$E2E_DIR/$1.pcap" -Y 'smb2.flags.response == 0 && smb2.cmd > 1' \
     -T fields -e smb2.flags.signature 2>/dev/null |
     tr ',' '\n' | awk '$1 == 1 { s++ } $1 == 0 { u++ } END { printf "%d %d", s, u }'
-}
-
-# The default run's connect and disconnect as tshark's dissectors read them:
-# command, response flag, dialects, NTLMSSP message type, flags, user, tree.
-wire_as_expected() {
-  local line i=0 expected=("0;0;0x0202,0x0210;" "0;1;0x0210;" "1;0;;0x00000001;0x20880205;"
-    "1;1;;0x00000002;" "1;0;;0x00000003;0x20880205;cifstest;" "1;1;;;;" '3;0;;;;;\\127.0.0.1\cifsshare'
-    "3;1;" "4;0;" "4;1;" "2;0;" "2;1;")
-  while IFS= read -r line; do
-    [[ "$line" == "${expected[i]:-nothing more}"* ]] || { echo "wire: $line"; return 1; }
-    i=$((i + 1))
-  done < <(tshark -r "$E2E_DIR/$1.pcap" -Y 'smb2.cmd <= 4' -T fields -E separator=';' -e smb2.cmd \
-    -e smb2.flags.response -e smb2.dialect -e ntlmssp.messagetype -e ntlmssp.negotiateflags \
-    -e ntlmssp.auth.username -e smb2.tree 2>/dev/null)
-  [[ "$i" -eq "${#expected[@]}" ]]
 }
 
 malformed() {
@@ -94,8 +79,6 @@ capture default e2e_cifsdrv G
 e2e_verify_status "default G" 00
 read -r signed unsigned <<<"$(signed_requests default)"
 e2e_check "default: $unsigned requests, none signed" test "$signed" -eq 0 -a "$unsigned" -gt 0
-e2e_check "default: the connect as tshark reads it" wire_as_expected default
-e2e_check "default: no malformed packet" test "$(malformed default)" -eq 0
 e2e_reset_vars
 seed_signing_variable
 capture variable e2e_cifsdrv G
