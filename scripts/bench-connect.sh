@@ -24,9 +24,9 @@ export CIFSDRV_RAMFS=$WORK/ramfs CIFSDRV_VARSTORE=$WORK/vars.txt
 
 # time_runs LABEL COMMAND...: the median of ROUNDS runs in milliseconds.
 time_runs() {
-  local label=$1 round start end
+  local label=$1 start end
   shift
-  for round in $(seq "$ROUNDS"); do
+  for _ in $(seq "$ROUNDS"); do
     start=$(date +%s%N)
     "$@" >"$WORK/out.txt" 2>&1 || { cat "$WORK/out.txt"; exit 1; }
     end=$(date +%s%N)

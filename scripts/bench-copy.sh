@@ -28,8 +28,8 @@ echo "== Release build without sanitizers ($BUILD)"
 cmake -S . -B "$BUILD" -G Ninja -DCIFSDRV_SANITIZE=OFF -DCMAKE_BUILD_TYPE=Release >/dev/null
 ninja -C "$BUILD" -j2 cifsdrv >/dev/null
 
-SMB_ENV=(SMB_STATE_DIR=$STATE_DIR SMB_MIN_PROTO=SMB2_02 SMB_MAX_PROTO=SMB2_10 SMB_USER=$SMB_USER
-  SMB_PASS=$SMB_PASS SMB_SHARE=$SMB_SHARE SMB_DIR=$SHARE_DIR)
+SMB_ENV=("SMB_STATE_DIR=$STATE_DIR" SMB_MIN_PROTO=SMB2_02 SMB_MAX_PROTO=SMB2_10 "SMB_USER=$SMB_USER"
+  "SMB_PASS=$SMB_PASS" "SMB_SHARE=$SMB_SHARE" "SMB_DIR=$SHARE_DIR")
 echo "== Samba on loopback"
 env "${SMB_ENV[@]}" bash scripts/samba-test-server.sh start
 
@@ -38,7 +38,7 @@ env "${SMB_ENV[@]}" bash scripts/samba-test-server.sh start
 OUT=$(mktemp -d "${TMPDIR:-/tmp}/bench-copy.XXXXXX")
 FILE=bench-copy.bin
 cleanup() {
-  rm -rf "$SHARE_DIR/$FILE" "$OUT"
+  rm -rf "${SHARE_DIR:?}/$FILE" "$OUT"
   env "${SMB_ENV[@]}" bash scripts/samba-test-server.sh stop >/dev/null 2>&1 || true
 }
 trap cleanup EXIT

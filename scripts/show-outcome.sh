@@ -10,7 +10,7 @@ hex_to_text() {
   for ((i = 0; i < ${#hex}; i += 2)); do
     pair=${hex:i:2}
     [ "$pair" = "00" ] && break
-    out+=$(printf "\\x$pair")
+    out+=$(printf '%b' "\\x$pair")
   done
   printf '%s' "$out"
 }
