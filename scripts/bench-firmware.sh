@@ -90,19 +90,9 @@ for %v in fs0 fs1 fs2 fs3
     map ramfs %v:
   endif
 endfor
-ifconfig -s eth0 dhcp
-for %i run (1 60)
-  if not "%netup%" == "1" then
-    ping -n 1 10.0.2.2 > nul
-    if %lasterror% == 0 then
-      set -v netup 1
-    else
-      stall 250000
-    endif
-  endif
-endfor
-ramfs:
 NSH
+  fw_nsh_network_wait
+  echo "ramfs:"
   for round in $(seq 1 "$ROUNDS"); do
     echo "echo \"@@BEGIN mount $round\""
     echo "%cifsdrv% M $standard"

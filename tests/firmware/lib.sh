@@ -49,6 +49,24 @@ fw_write_startup() {
   sed 's/$/\r/' >"$1"
 }
 
+# Script lines for the network: DHCP, then a bounded wait until the server's
+# address answers (QEMU's stack answers the ping itself); %netup% is 1 then.
+fw_nsh_network_wait() {
+  cat <<'NSH'
+ifconfig -s eth0 dhcp
+for %i run (1 60)
+  if not "%netup%" == "1" then
+    ping -n 1 10.0.2.2 > nul
+    if %lasterror% == 0 then
+      set -v netup 1
+    else
+      stall 250000
+    endif
+  endif
+endfor
+NSH
+}
+
 # fw_make_disk IMAGE EFI STARTUP [NAME]: a 16 MiB FAT disk, without partition
 # table, holding the image (as NAME, by default CIFSDrv.efi) and the startup
 # script in its root.

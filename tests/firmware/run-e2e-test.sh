@@ -121,8 +121,7 @@ endfor
 NSH
 }
 
-# The RAM disk by its marker, then the network: DHCP, and a bounded wait
-# until the server's address answers (QEMU's stack answers the ping itself).
+# The RAM disk by its marker, then the network.
 nsh_ramfs_and_network() {
   cat <<'NSH'
 for %v in fs0 fs1 fs2 fs3
@@ -133,17 +132,9 @@ endfor
 if exist ramfs:\marker then
   echo "@@RAMFS mapped"
 endif
-ifconfig -s eth0 dhcp
-for %i run (1 60)
-  if not "%netup%" == "1" then
-    ping -n 1 10.0.2.2 > nul
-    if %lasterror% == 0 then
-      set -v netup 1
-    else
-      stall 250000
-    endif
-  endif
-endfor
+NSH
+  fw_nsh_network_wait
+  cat <<'NSH'
 if "%netup%" == "1" then
   echo "@@NET up"
 endif
