@@ -240,9 +240,8 @@ UINT32 ReadBody(const SMB2_COMMAND *Command, void *Context, FRAME_READER *Frame,
 UINT32 ReceiveAnswer(const SMB2_COMMAND *Command, void *Context) {
   SMB2_RESPONSE Response;
   ZeroMem(&Response, sizeof(Response));
-  UINT32 Nt = STATUS_UNSUCCESSFUL;
   EFI_STATUS Status =
-      SMB2ReadVerifyHeader(&Response.Header, &TransactDetails, gSMB2SockFd, &Nt, Command->Command);
+      SMB2ReadVerifyHeader(&Response.Header, &TransactDetails, gSMB2SockFd, Command->Command);
   if (Status == EFI_PROTOCOL_ERROR || Status == EFI_COMPROMISED_DATA) {
     ReportHeaderFailure(Command, Status);
     MarkBroken(STATUS_UNSUCCESSFUL);

@@ -67,37 +67,35 @@ EFI_STATUS RunQuery(const SMB2_COMMAND *Command, const SMB2_QUERY_ANSWER_TEXTS *
   return Status;
 }
 
+// CREATE and CLOSE: the arguments Given, one command on the file, and the
+// connection's state when it succeeded.
+EFI_STATUS RunOnFile(const SMB2_COMMAND *Command, bool Given, FILE_ACCESS_DETAILS *Access,
+                     UINT8 State, const CHAR8 *Function, UINT32 Line) {
+  DiagEntry(DiagChannel::Smb2, Function, Line);
+  if (!Given) {
+    DiagNullInput(DiagChannel::Smb2, Function, Line);
+    return EFI_INVALID_PARAMETER;
+  }
+  SMB2_FILE_CONTEXT Context = FileContext(Access);
+  EFI_STATUS Status = RunFileCommand(Command, &Context, Function, Line);
+  if (!EFI_ERROR(Status)) {
+    SMB2ConnectionState = State;
+  }
+  DiagExit(Status, DiagChannel::Smb2, Function, Line);
+  return Status;
+}
+
 } // namespace
 
 EFI_STATUS SMB2_Open(SMB2ShareDetails *Share, SMB2_CLIENT_SESSION *Session,
                      FILE_ACCESS_DETAILS *Access) {
-  DiagEntry(DiagChannel::Smb2);
-  if (Share == nullptr || Session == nullptr || Access == nullptr) {
-    DiagNullInput();
-    return EFI_INVALID_PARAMETER;
-  }
-  SMB2_FILE_CONTEXT Context = FileContext(Access);
-  EFI_STATUS Status = RunFileCommand(&gSMB2CreateCommand, &Context, __func__, __LINE__);
-  if (!EFI_ERROR(Status)) {
-    SMB2ConnectionState = SMB2_STATE_FILE_OPEN;
-  }
-  DiagExit(Status, DiagChannel::Smb2);
-  return Status;
+  bool Given = Share != nullptr && Session != nullptr && Access != nullptr;
+  return RunOnFile(&gSMB2CreateCommand, Given, Access, SMB2_STATE_FILE_OPEN, __func__, __LINE__);
 }
 
 EFI_STATUS SMB2_Close(FILE_ACCESS_DETAILS *Access) {
-  DiagEntry(DiagChannel::Smb2);
-  if (Access == nullptr) {
-    DiagNullInput();
-    return EFI_INVALID_PARAMETER;
-  }
-  SMB2_FILE_CONTEXT Context = FileContext(Access);
-  EFI_STATUS Status = RunFileCommand(&gSMB2CloseCommand, &Context, __func__, __LINE__);
-  if (!EFI_ERROR(Status)) {
-    SMB2ConnectionState = SMB2_STATE_FILE_CLOSED;
-  }
-  DiagExit(Status, DiagChannel::Smb2);
-  return Status;
+  return RunOnFile(&gSMB2CloseCommand, Access != nullptr, Access, SMB2_STATE_FILE_CLOSED, __func__,
+                   __LINE__);
 }
 
 EFI_STATUS SMB2_Read(SMB2ShareDetails *Share, SMB2_CLIENT_SESSION *Session,

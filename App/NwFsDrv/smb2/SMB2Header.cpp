@@ -177,42 +177,30 @@ INT32 SMB2ReceiveAll(INT32 SockFd, void *Buffer, UINT64 Length, TRANSACT_DETAILS
   return Result;
 }
 
-UINT32 SMB2DrainBytes(INT32 SockFd, UINT64 Length, TRANSACT_DETAILS *Details, UINT64 *Drained) {
-  UINT64 LocalDrained;
-  if (Drained == nullptr) {
-    Drained = &LocalDrained;
-  }
-  *Drained = 0;
-  if (Length == 0) {
-    return SMB2_NT_SUCCESS;
-  }
-  if (Length > SMB2_MAX_STREAM_LENGTH) {
-    Length = SMB2_MAX_STREAM_LENGTH;
-  }
+namespace {
+
+// Reads and discards Length bytes in bounded pieces.
+bool DrainBytes(INT32 SockFd, UINT64 Length, TRANSACT_DETAILS *Details) {
   UINT8 Scratch[kDrainChunk];
-  UINT32 Status = SMB2_NT_SUCCESS;
   while (Length > 0) {
     UINT64 Piece = Length < kDrainChunk ? Length : kDrainChunk;
-    INT64 Got = 0;
-    INT32 Rx = SMB2ReceiveAll(SockFd, Scratch, Piece, Details, &Got);
-    if (Got > 0) {
-      *Drained += static_cast<UINT64>(Got);
-    }
-    if (Rx != 0) {
-      Status = STATUS_UNSUCCESSFUL;
-      break;
+    if (SMB2ReceiveAll(SockFd, Scratch, Piece, Details) != 0) {
+      return false;
     }
     Length -= Piece;
   }
-  return Status;
+  return true;
 }
-
-namespace {
 
 // Answers the header read passes over on its way to the final one: interim
 // answers (STATUS_PENDING says only that the final answer follows) and
-// unsolicited notifications.
+// unsolicited notifications, each of a length a frame can have (any other is
+// left to the out-of-step check).
 bool IsSkippedAnswer(const SMB2_HEADER *Header, const TRANSACT_DETAILS *Details) {
+  UINT32 Stream = SMB2StreamLength(Header);
+  if (Stream < SMB2_HEADER_STRUCTURE_SIZE || Stream > SMB2_MAX_STREAM_LENGTH) {
+    return false;
+  }
   if (Header->MessageId == SMB2_NOTIFICATION_MESSAGE_ID) {
     return true;
   }
@@ -242,7 +230,7 @@ INT32 ReceiveFinalHeader(UINT8 *Buffer, TRANSACT_DETAILS *Details, INT32 SockFd,
       return NwErrno::ETIMEDOUT_;
     }
     Smb2Log(DIAG_VERBOSE, "Interim response, waiting for the final one\n");
-    if (SMB2DrainBytes(SockFd, SMB2BodyLength(Received), Details) != SMB2_NT_SUCCESS) {
+    if (!DrainBytes(SockFd, SMB2BodyLength(Received), Details)) {
       return -1;
     }
     Rx = SMB2ReceiveAll(SockFd, Buffer, SMB2_FRAMED_HEADER_SIZE, Details, BytesRead);
@@ -282,12 +270,7 @@ bool OutOfStep(const SMB2_HEADER *Header, const TRANSACT_DETAILS *Details, UINT1
 } // namespace
 
 EFI_STATUS SMB2ReadVerifyHeader(SMB2_HEADER *Header, TRANSACT_DETAILS *Details, INT32 SockFd,
-                                UINT32 *NtStatus, UINT16 Command) {
-  UINT32 LocalNt;
-  if (NtStatus == nullptr) {
-    NtStatus = &LocalNt;
-  }
-  *NtStatus = STATUS_UNSUCCESSFUL;
+                                UINT16 Command) {
   if (Header == nullptr || Details == nullptr) {
     DiagNullInput();
     return EFI_INVALID_PARAMETER;
@@ -313,7 +296,6 @@ EFI_STATUS SMB2ReadVerifyHeader(SMB2_HEADER *Header, TRANSACT_DETAILS *Details, 
     return EFI_COMPROMISED_DATA;
   }
   CopyMem(Header, Buffer, SMB2_FRAMED_HEADER_SIZE);
-  *NtStatus = EFI_ERROR(Status) ? STATUS_UNSUCCESSFUL : SMB2_NT_SUCCESS;
   return Status;
 }
 

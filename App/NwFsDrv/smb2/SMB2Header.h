@@ -263,17 +263,12 @@ EFI_STATUS SMB2VerifyHeader(const SMB2_HEADER *Header, TRANSACT_DETAILS *Details
 //                           header copied out; the rest of its message is the
 //                           caller's to consume.
 EFI_STATUS SMB2ReadVerifyHeader(SMB2_HEADER *Header, TRANSACT_DETAILS *Details, INT32 SockFd,
-                                UINT32 *NtStatus, UINT16 Command);
+                                UINT16 Command);
 // Receives exactly Length bytes (the read-all operation with the standard
 // loop limit), recording the transport status in the record. Returns the
 // transport result; *Received gets the byte count.
 INT32 SMB2ReceiveAll(INT32 SockFd, void *Buffer, UINT64 Length, TRANSACT_DETAILS *Details,
                      INT64 *Received = nullptr);
-// Reads and discards Length bytes in bounded pieces (at most the largest
-// stream a server may announce). Returns 0 or STATUS_UNSUCCESSFUL; *Drained
-// gets the bytes consumed.
-UINT32 SMB2DrainBytes(INT32 SockFd, UINT64 Length, TRANSACT_DETAILS *Details,
-                      UINT64 *Drained = nullptr);
 // The body bytes that follow a framed header (stream length − 64), or 0 for
 // a stream shorter than a header.
 UINT32 SMB2BodyLength(const SMB2_HEADER *Header);
